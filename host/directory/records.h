@@ -1,0 +1,25 @@
+/* The directory's own records as bytes and back, through the marshaller. */
+#pragma once
+
+#include <cstdint>
+#include <vector>
+
+#include "platform/karst_directory.h"
+
+namespace host {
+
+/* The same tables as every reader's; each ends with an all-zero row. */
+extern const ExprMshField nodeRecordTable[];
+extern const ExprMshField netInterfaceRecordTable[];
+extern const ExprMshField healthRecordTable[];
+
+std::vector<uint8_t> encode(const KarstNodeEntry &record);
+std::vector<uint8_t> encode(const KarstNetInterfaceEntry &record);
+std::vector<uint8_t> encode(const KarstHealthStatusEntry &record);
+
+/* ZEL_OK, or why the bytes were refused (expr_msh.h). `record` is overwritten. */
+zel_Status decode(const std::vector<uint8_t> &data, KarstNodeEntry *record);
+zel_Status decode(const std::vector<uint8_t> &data, KarstNetInterfaceEntry *record);
+zel_Status decode(const std::vector<uint8_t> &data, KarstHealthStatusEntry *record);
+
+}  // namespace host

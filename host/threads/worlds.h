@@ -1,0 +1,31 @@
+/* What the rest of the host asks of the worlds and spinlocks layer, beside the platform functions
+ * (zel_World..., TOLM_World..., zel_Spinlock..., zel_LockDomain..., tolmapi_Preemption...).
+ * Implemented by host/threads and by sim.
+ */
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <string>
+#include <vector>
+
+namespace host {
+
+struct WorldSettings {
+  std::chrono::milliseconds stopTimeout{30'000}; /* a stop that takes longer is fatal and says where */
+  std::chrono::microseconds lockSlice{2'000};    /* a lock held longer, with a waiter, is due */
+};
+void configureWorlds(const WorldSettings &settings);
+
+/* Returns when every world sleeps in its wait with no wake-up pending. Not from a world. */
+void waitUntilWorldsIdle();
+
+/* How often any world has been woken or has gone to sleep: unchanged between two idle moments means
+ * that nothing ran in between. */
+uint64_t worldsActivity();
+
+/* What is alive: "world KARSTResolverCache (waits: KARSTResolverCacheWorld)", "lock ... in domain
+ * ...", one line each; empty when all was given back. */
+std::vector<std::string> aliveWorldsAndLocks();
+
+}  // namespace host

@@ -1,0 +1,51 @@
+/* The tracing library: streams, class levels, token buckets; behind the Trace_ and TokenBucket_
+ * functions. The ring is read here for tests, tools and dumps.
+ */
+#pragma once
+
+#include <cstdint>
+#include <vector>
+
+#include "platform/tracing.h"
+
+namespace host {
+
+struct TraceSettings {
+  uint32_t slots = 16384;         /* of the ring, a power of two */
+  bool enabled = true;
+  bool throttling = true;
+  int32_t classLevel = 0;         /* of every class to begin with */
+  bool notify = true;             /* wall-clock entries and notification */
+  uint64_t perEventBurst = 64;    /* tokens of a small bucket */
+  uint64_t perEventPerSecond = 64;
+  uint64_t globalBurst = 4096;
+  uint64_t globalPerSecond = 4096;
+};
+
+/* Starts over: an empty ring and full buckets for streams of these settings. Nobody may be emitting. */
+void configureTracing(const TraceSettings &settings);
+
+void setTraceClassLevel(uint32_t traceClass, int32_t level);
+void setTraceThrottling(bool on);
+void setTraceEnabled(bool on);
+
+/* The finished records of the ring, oldest first: those whose phase and sequence number belong to the
+ * last lap. */
+struct TracedRecord {
+  uint64_t sequence;
+  uint32_t type, id, site, processor;
+  uint64_t timeNanoseconds;
+  uint64_t payload[6];
+};
+std::vector<TracedRecord> readTrace();
+
+/* Pairs of a record's time stamp and the wall clock (ns since 1970) at that moment. */
+struct WallClockEntry {
+  uint64_t sequence;
+  uint64_t timeNanoseconds;
+  uint64_t wallNanoseconds;
+};
+std::vector<WallClockEntry> wallClockEntries();
+uint64_t traceNotifications(); /* calls of Trace_Notify so far */
+
+}  // namespace host

@@ -16,13 +16,14 @@ extern "C" {
 /* ---- Entries --------------------------------------------------------------------------------- */
 
 /* Types of entries that carry a record known here. An object's type is its user's. */
-#define KARST_TYPE_NODE 3u          /* UUID: the node's; KarstNodeEntry */
-#define KARST_TYPE_NET_INTERFACE 6u /* UUID: the interface's, owner: its node; KarstNetInterfaceEntry */
+#define KARST_TYPE_NODE 3u /* UUID: the node's; KarstNodeEntry */
+#define KARST_TYPE_NET_INTERFACE \
+  6u /* UUID: the interface's, owner: its node; KarstNetInterfaceEntry */
 #define KARST_TYPE_HEALTH_STATUS 7u /* UUID: the interface's; KarstHealthStatusEntry */
 
 typedef struct KarstEntryHeader {
   zel_UUID uuid;
-  zel_UUID owner;       /* the node that owns the entry */
+  zel_UUID owner;        /* the node that owns the entry */
   uint8_t directory[28]; /* the directory's own */
   uint32_t dataLength;   /* bytes of marshalled data behind the header in a whole entry */
 } KarstEntryHeader;
@@ -123,7 +124,8 @@ ZEL_STATIC_ASSERT(sizeof(KarstHealthStatusEntry) == 24, "layout of a health reco
 ZEL_STATIC_ASSERT(offsetof(KarstHealthStatusEntry, timestamp) == 8, "layout of a health record");
 ZEL_STATIC_ASSERT(offsetof(KarstHealthStatusEntry, healthReason) == 16, "health record");
 
-/* ---- Status of the directory ------------------------------------------------------------------ */
+/* ---- Status of the directory ------------------------------------------------------------------
+ */
 
 #define KARST_STATUS_USABLE 0x1u
 
@@ -132,7 +134,8 @@ ZEL_STATIC_ASSERT(offsetof(KarstHealthStatusEntry, healthReason) == 16, "health 
  * unusable alternate. A directory that is usable already says so to a new registration. */
 typedef void (*KarstStatusFn)(void *data, uint32_t status);
 
-/* ZEL_OK or ZEL_NO_MEMORY. Calls may come before this returns. Blocks: yes. Under a spinlock: no. */
+/* ZEL_OK or ZEL_NO_MEMORY. Calls may come before this returns. Blocks: yes. Under a spinlock: no.
+ */
 zel_Status KARST_RegisterStatusCallback(KarstStatusFn fn, void *data);
 
 /* No call of the pair runs, or will run, after this returned. A pair that was never registered is
@@ -142,7 +145,8 @@ void KARST_DeregisterStatusCallback(KarstStatusFn fn, void *data);
 /* Stores this host's node UUID. Blocks: no. Under a spinlock: yes. */
 void KARST_GetSelfUUID(zel_UUID *uuid);
 
-/* ---- Subscriptions ------------------------------------------------------------------------------ */
+/* ---- Subscriptions ------------------------------------------------------------------------------
+ */
 
 /* A subscriber's callback, called on the directory's own threads, never from inside KARST_Subscribe
  * or KARST_Unsubscribe. Calls of one subscription never overlap and come in the order of the
@@ -155,8 +159,8 @@ void KARST_GetSelfUUID(zel_UUID *uuid);
  *   ZEL_SUB_CANCELLED  the last call of a subscription that was cancelled
  *
  * `header` is meaningful with the first two. `argument` has no meaning. The result is ignored. */
-typedef zel_Status (*KarstSubscriptionFn)(void *data, const KarstEntryHeader *header, void *argument,
-                                          zel_Status status);
+typedef zel_Status (*KarstSubscriptionFn)(void *data, const KarstEntryHeader *header,
+                                          void *argument, zel_Status status);
 
 /* Starts a subscription. `query` stays in place and unchanged until the last call. ZEL_OK;
  * ZEL_BAD_PARAM (KARST_QUERY_BY_TYPE not set); ZEL_NO_MEMORY. Blocks: no. Under a spinlock: yes. */
@@ -167,7 +171,8 @@ zel_Status KARST_Subscribe(const KarstQuery *query, KarstSubscriptionFn fn, void
  * a spinlock: yes. */
 void KARST_Unsubscribe(const KarstQuery *query, KarstSubscriptionFn fn, void *data);
 
-/* ---- Lookups ------------------------------------------------------------------------------------ */
+/* ---- Lookups ------------------------------------------------------------------------------------
+ */
 
 /* Walks the entries that match, in ascending order of UUID. `next` 0 gives the first; `next` 1 the
  * one after the entry that `header` still names from the call before, whatever was added or removed

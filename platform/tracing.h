@@ -35,12 +35,12 @@ typedef struct TokenBucketMini {
 } TokenBucketMini;
 ZEL_STATIC_ASSERT(sizeof(TokenBucketMini) == 16, "layout of a small bucket");
 
-/* A stream and its ring of mask + 1 records. Record s (its sequence number) goes to slot s AND mask;
- * its phase bit is the inverse of the bit of s at lapShift, so that a reader tells a finished
+/* A stream and its ring of mask + 1 records. Record s (its sequence number) goes to slot s AND
+ * mask; its phase bit is the inverse of the bit of s at lapShift, so that a reader tells a finished
  * record of this lap from one of the lap before. */
 typedef struct TraceStream {
-  uint64_t sequence;      /* fetched and incremented atomically, once a record */
-  uint64_t library0;      /* the library's own */
+  uint64_t sequence; /* fetched and incremented atomically, once a record */
+  uint64_t library0; /* the library's own */
   TokenBucket globalBucket;
   uint8_t throttling; /* non-zero: emitters ask the buckets */
   uint8_t library1[15];
@@ -62,7 +62,7 @@ ZEL_STATIC_ASSERT(offsetof(TraceStream, notifyHandle) == 96, "layout of a stream
 ZEL_STATIC_ASSERT(sizeof(TraceStream) == 128, "the ring follows at 128");
 
 #define TRACE_STREAM_ENABLED 0x1u
-#define TRACE_STREAM_RING 128u     /* offset of slot 0 */
+#define TRACE_STREAM_RING 128u       /* offset of slot 0 */
 #define TRACE_WALL_CLOCK_EVERY 2048u /* records between two wall-clock entries */
 #define TRACE_NOTIFY_EVERY 512u      /* records between two notifications */
 

@@ -35,16 +35,16 @@ extern "C" {
 
 typedef uint32_t zel_Status;
 
-#define ZEL_OK 0u                         /* success; in a subscription: the entry is present */
-#define ZEL_FAILURE 0x0bad0001u           /* generic failure */
-#define ZEL_NOT_FOUND 0x0bad0003u         /* no such entry; in a subscription: entry removed */
-#define ZEL_BAD_PARAM 0x0bad0007u         /* an argument is not acceptable */
-#define ZEL_NO_MEMORY 0x0bad0014u         /* an allocation failed */
-#define ZEL_SUB_OVERFLOW 0x0bad002fu      /* in a subscription: changes were lost, rescan */
-#define ZEL_SUB_CANCELLED 0x0bad0030u     /* in a subscription: its final call */
-#define ZEL_NOT_INITIALIZED 0x0bad0031u   /* the service asked does not exist (yet) */
-#define ZEL_WORLD_STOPPING 0x0bad0069u    /* a wait ends because the world is being stopped */
-#define ZEL_SUB_RESYNC 0x0bad0113u        /* in a subscription: start over, rescan */
+#define ZEL_OK 0u                       /* success; in a subscription: the entry is present */
+#define ZEL_FAILURE 0x0bad0001u         /* generic failure */
+#define ZEL_NOT_FOUND 0x0bad0003u       /* no such entry; in a subscription: entry removed */
+#define ZEL_BAD_PARAM 0x0bad0007u       /* an argument is not acceptable */
+#define ZEL_NO_MEMORY 0x0bad0014u       /* an allocation failed */
+#define ZEL_SUB_OVERFLOW 0x0bad002fu    /* in a subscription: changes were lost, rescan */
+#define ZEL_SUB_CANCELLED 0x0bad0030u   /* in a subscription: its final call */
+#define ZEL_NOT_INITIALIZED 0x0bad0031u /* the service asked does not exist (yet) */
+#define ZEL_WORLD_STOPPING 0x0bad0069u  /* a wait ends because the world is being stopped */
+#define ZEL_SUB_RESYNC 0x0bad0113u      /* in a subscription: start over, rescan */
 
 /* Text of a status, such as "ZEL_NO_MEMORY"; never null, valid for ever. A value that nobody knows
  * reads "unknown status". Blocks: no. Under a spinlock: yes. */

@@ -64,7 +64,7 @@ void KARSTResolverUpdateAddressesLocked(KARSTResolverInstance *instance) {
     own->locators[0].networkType = KARST_RESOLVER_LOCATOR_LOCAL;
     state = KARST_RESOLVER_STATE_RESOLVED;
   } else if (node != nullptr && node->reachable && node->locators.count != 0) {
-    *own = node->locators;
+    __builtin_memcpy(own, &node->locators, sizeof *own);
     state = KARST_RESOLVER_STATE_RESOLVED;
   } else {
     __builtin_memset(own, 0, sizeof *own);

@@ -2,7 +2,9 @@
  *
  *   host::Kernel kernel;
  *   host::Module &resolver = kernel.modules().load("karst_resolver.so");
- *   kernel.directory().setSelf(...); kernel.directory().put(...); kernel.directory().setUsable(true);
+ *   kernel.directory().setSelf(...);
+ *   kernel.directory().put(...);
+ *   kernel.directory().setUsable(true);
  *   kernel.settle();
  *   auto *create = resolver.function<decltype(KARSTResolver_Create)>("KARSTResolver_Create");
  *
@@ -47,8 +49,8 @@ class Kernel {
    * world has finished what that gave it to do. Not from a callback or a world. */
   void settle();
 
-  /* All that is alive: modules, worlds, locks, domains, heaps and their blocks, subscriptions, logs;
-   * a line each. */
+  /* All that is alive: modules, worlds, locks, domains, heaps and their blocks, subscriptions,
+   * logs; a line each. */
   std::vector<std::string> alive() const;
 
  private:

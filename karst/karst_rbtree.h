@@ -41,8 +41,7 @@ struct KARSTMemPool {
   uint64_t base; /* links are relative to this address */
 };
 
-/* ---- Keys --------------------------------------------------------------------------------------
- */
+/* ---- Keys ------------------------------------------------------------------------------------ */
 
 #define KARSTRBTREE_KEY_HEADER 1u           /* type, id, seq (descending) of a header */
 #define KARSTRBTREE_KEY_SECONDARY_HEADER 2u /* secondaryId of a header, then as KEY_HEADER */
@@ -82,8 +81,7 @@ static_assert(offsetof(KARSTRBTreeHeader, secondaryId) == 16, "layout of a heade
 static_assert(offsetof(KARSTRBTreeHeader, seq) == 32, "layout of a header");
 static_assert(offsetof(KARSTRBTreeHeader, type) == 40, "layout of a header");
 
-/* ---- Nodes and trees
- * ----------------------------------------------------------------------------- */
+/* ---- Nodes and trees ------------------------------------------------------------------------- */
 
 #define KARSTRBTREE_NODE_VALUE 0x3fffffffu /* bits of KARSTRBTreeNode.word */
 #define KARSTRBTREE_NODE_RED 0x40000000u
@@ -131,8 +129,7 @@ static_assert(offsetof(KARSTRBTree, freeValFn) == 40, "layout of a tree");
 static_assert(offsetof(KARSTRBTree, treeAllocated) == 56, "layout of a tree");
 static_assert(offsetof(KARSTRBTree, data) == 64, "layout of a tree");
 
-/* ---- Making and ending trees
- * --------------------------------------------------------------------- */
+/* ---- Making and ending trees ----------------------------------------------------------------- */
 
 /* A new empty tree with everything from `pool`, or null. With `nil`, that node of the caller's is
  * overwritten and serves as the nil; trees that share one must not be modified at the same time. */
@@ -157,8 +154,7 @@ KARSTRBTreeFreeValFn KARSTRBTree_SetFreeValFn(KARSTRBTree *tree, KARSTRBTreeFree
 KARSTRBTreeMpFreeValFn KARSTRBTree_SetMpFreeValFn(KARSTRBTree *tree,
                                                   KARSTRBTreeMpFreeValFn function);
 
-/* ---- Using trees
- * ------------------------------------------------------------------------------------ */
+/* ---- Using trees ----------------------------------------------------------------------------- */
 
 uint32_t KARSTRBTree_GetSize(const KARSTRBTree *tree);
 
@@ -199,8 +195,7 @@ void KARSTRBTree_Swap(KARSTRBTree *a, KARSTRBTree *b);
 
 } /* extern "C" */
 
-/* ---- Key comparison
- * ----------------------------------------------------------------------------------- */
+/* ---- Key comparison -------------------------------------------------------------------------- */
 
 static inline uint64_t KARSTRBTreeWord(const void *bytes) {
   uint64_t word;

@@ -229,8 +229,7 @@ bool EqualsProbe(const KARSTRBTree *tree, const KARSTRBTreeKey *probe,
 
 }  // namespace
 
-/* ---- Making and ending trees -------------------------------------------------------------------
- */
+/* ---- Making and ending trees ----------------------------------------------------------------- */
 
 uint8_t KARSTRBTree_CreateTreeData(KARSTRBTree *tree, KARSTRBTreeNode *nil) {
   tree->data = (KARSTRBTreeData *)tree->calloc(tree, 1, sizeof(KARSTRBTreeData));
@@ -312,8 +311,7 @@ KARSTRBTreeMpFreeValFn KARSTRBTree_SetMpFreeValFn(KARSTRBTree *tree,
   return previous;
 }
 
-/* ---- Insertion ---------------------------------------------------------------------------------
- */
+/* ---- Insertion ------------------------------------------------------------------------------- */
 
 KARSTRBTreeNode *PREF_InsertEx(KARSTRBTree *tree, KARSTRBTreeNode *node, KARSTRBTreeKey *key,
                                uint32_t value) {
@@ -356,8 +354,7 @@ KARSTRBTreeNode *KARSTRBTree_InsertNoAlloc(KARSTRBTree *tree, KARSTRBTreeNode *n
   return PREF_InsertEx(tree, node, key, value);
 }
 
-/* ---- Lookup and iteration
- * ------------------------------------------------------------------------ */
+/* ---- Lookup and iteration -------------------------------------------------------------------- */
 
 uint32_t KARSTRBTree_GetSize(const KARSTRBTree *tree) {
   return tree->data->count;
@@ -412,8 +409,7 @@ KARSTRBTreeNode *KARSTRBTree_Prev(const KARSTRBTree *tree, const KARSTRBTreeNode
   return Outermost(tree, Root(tree), RIGHT);
 }
 
-/* ---- Removal
- * --------------------------------------------------------------------------------------- */
+/* ---- Removal --------------------------------------------------------------------------------- */
 
 void KARSTRBTree_Remove(KARSTRBTree *tree, KARSTRBTreeNode *node) {
   uint64_t value = node->word & KARSTRBTREE_NODE_VALUE;

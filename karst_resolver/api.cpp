@@ -11,9 +11,7 @@
 
 extern "C" {
 
-/* ---- Create
- * ------------------------------------------------------------------------------------------------
- */
+/* ---- Create ---------------------------------------------------------------------------------- */
 
 /* Nobody else knows the instance yet, so its fields need no lock. */
 static void KARSTResolverInitInstance(KARSTResolverInstance *instance, uint32_t entryType,
@@ -102,8 +100,7 @@ EXPORTED zel_Status KARSTResolver_Create(KARSTResolverInstance **result, uint32_
   return ZEL_OK;
 }
 
-/* ---- Destroy, callback, read-out
- * ---------------------------------------------------------------------------- */
+/* ---- Destroy, callback, read-out ------------------------------------------------------------- */
 
 EXPORTED void KARSTResolver_Destroy(KARSTResolverInstance *instance) {
   KARSTResolverCache *cache = karstResolverCache;

@@ -23,8 +23,7 @@ zel_Status KARSTResolverLockCreate(KARSTResolverLock *lock, const char *name, ui
   return zel_SpinlockCreate(&props, &lock->handle);
 }
 
-/* ---- Enable and disable
- * -------------------------------------------------------------------------------- */
+/* ---- Enable and disable ---------------------------------------------------------------------- */
 
 /* The steps of an enable until one fails. A function of its own, so that the reports of all of them
  * carry its name. */
@@ -112,8 +111,7 @@ void KARSTResolverCacheEnableDisable(void *data, uint32_t status) {
   KARSTResolverCacheDisable(cache);
 }
 
-/* ---- Creation and end
- * -------------------------------------------------------------------------------------- */
+/* ---- Creation and end ------------------------------------------------------------------------ */
 
 /* The unchecked functions run while no other thread knows the cache: before it is registered
  * anywhere, and after the last reference on it is gone. */

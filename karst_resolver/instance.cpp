@@ -10,8 +10,7 @@ extern "C" {
 
 uint64_t karstResolverInstancesAlive;
 
-/* ---- Looks without a lock
- * ------------------------------------------------------------------------------ */
+/* ---- Looks without a lock -------------------------------------------------------------------- */
 
 bool KARSTResolverIsDestroyed(const KARSTResolverInstance *instance) KARST_UNCHECKED {
   return __atomic_load_n(&instance->destroyed, __ATOMIC_RELAXED) != 0;
@@ -30,8 +29,7 @@ zel_UUID KARSTResolverTrackedNodeUUID(const KARSTResolverInstance *instance) {
   return KARSTResolverIsAttached(instance) ? instance->boundNodeUUID : zel_UUID{};
 }
 
-/* ---- Attaching
- * ---------------------------------------------------------------------------------------------- */
+/* ---- Attaching ------------------------------------------------------------------------------- */
 
 void KARSTResolverAttach(KARSTResolverInstance *instance, KARSTResolverNode *node) {
   KARSTResolverListPushFront(&node->instanceList, &instance->nodeLinks);
@@ -46,9 +44,7 @@ void KARSTResolverDetach(KARSTResolverCache *cache, KARSTResolverInstance *insta
   __atomic_store_n(&instance->node, (KARSTResolverNode *)nullptr, __ATOMIC_RELAXED);
 }
 
-/* ---- Refresh
- * --------------------------------------------------------------------------------------------------
- */
+/* ---- Refresh --------------------------------------------------------------------------------- */
 
 void KARSTResolverUpdateAddressesLocked(KARSTResolverInstance *instance) {
   KARSTResolverNode *node = instance->node;
@@ -109,9 +105,7 @@ uint32_t KARSTResolverReadState(KARSTResolverInstance *instance) {
   return state;
 }
 
-/* ---- Release
- * ----------------------------------------------------------------------------------------------------
- */
+/* ---- Release --------------------------------------------------------------------------------- */
 
 __attribute__((noinline)) void KARSTResolverReleaseInstance(KARSTResolverInstance *instance) {
   uint64_t before = KARSTResolverCountDown(&instance->refCount);

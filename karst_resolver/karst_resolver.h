@@ -22,8 +22,7 @@
 extern "C" {
 #endif
 
-/* ---- Locators
- * ------------------------------------------------------------------------------------ */
+/* ---- Locators -------------------------------------------------------------------------------- */
 
 #define KARST_RESOLVER_LOCATOR_IPV4 1u  /* the first 4 bytes of the address count */
 #define KARST_RESOLVER_LOCATOR_IPV6 2u  /* all 16 bytes */
@@ -64,8 +63,7 @@ static inline size_t KARSTResolverNodeLocatorsSize(uint16_t capacity) {
          (size_t)capacity * sizeof(KARSTResolverNodeLocator);
 }
 
-/* ---- Instances
- * ------------------------------------------------------------------------------------- */
+/* ---- Instances ------------------------------------------------------------------------------- */
 
 typedef struct KARSTResolverInstance KARSTResolverInstance;
 

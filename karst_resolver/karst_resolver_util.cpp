@@ -19,8 +19,7 @@ void KARSTResolverFree(void *block) {
   zel_HeapFree(karstResolverHeapID, block);
 }
 
-/* ---- For the ordered map
- * ------------------------------------------------------------------------- */
+/* ---- For the ordered map --------------------------------------------------------------------- */
 
 static KARST_RESOLVER_RECORDS_CALLER void *KARSTResolverMemPoolAlloc(void *, uint64_t size) {
   return KARSTResolverAllocWithRA((uint32_t)size, __builtin_return_address(0));
@@ -52,8 +51,7 @@ const KARSTMemPool karstResolverMemPool = {
     0, /* links are plain addresses */
 };
 
-/* ---- For the directory and the marshaller
- * -------------------------------------------------------- */
+/* ---- For the directory and the marshaller ---------------------------------------------------- */
 
 static KARST_RESOLVER_RECORDS_CALLER void *KARSTResolverExprAllocFunc(void *, uint64_t size) {
   return KARSTResolverAllocWithRA((uint32_t)size, __builtin_return_address(0));

@@ -32,8 +32,7 @@ extern const ExprMshAllocator resolverMshAlloc;
 
 } /* extern "C" */
 
-/* ---- UUIDs -------------------------------------------------------------------------------------
- */
+/* ---- UUIDs ----------------------------------------------------------------------------------- */
 
 /* The text form, 36 characters; its arguments are the 16 bytes in order. */
 #define KARST_RESOLVER_UUID_FORMAT                                   \
@@ -62,8 +61,7 @@ static inline bool KARSTResolverUUIDIsPresent(const zel_UUID *uuid) {
   return (KARSTResolverUUIDLow(uuid) | KARSTResolverUUIDHigh(uuid)) != 0;
 }
 
-/* ---- Tags
- * ---------------------------------------------------------------------------------------- */
+/* ---- Tags ------------------------------------------------------------------------------------ */
 
 /* The first 8 bytes of the cache, of nodes, interfaces and instances: readable in a memory dump,
  * and complemented once the structure is free. */
@@ -74,8 +72,7 @@ static inline void KARSTResolverTagFree(char *tag, const char *text) {
   for (int i = 0; i < 8; i++) tag[i] = (char)~text[i];
 }
 
-/* ---- Debug build
- * ------------------------------------------------------------------------------------ */
+/* ---- Debug build ----------------------------------------------------------------------------- */
 
 /* What must hold if the module is right. Checked in debug builds, where a breach stops the system.
  */

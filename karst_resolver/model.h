@@ -89,8 +89,7 @@ static_assert(KARST_RESOLVER_QUERY_VERSION == 0x05, "flags of a version refresh"
 
 struct KARSTResolverCache;
 
-/* ---- Node
- * ---------------------------------------------------------------------------------------- */
+/* ---- Node ------------------------------------------------------------------------------------ */
 
 struct KARSTResolverNode {
   char tag[8]; /* complemented while the slot is free */
@@ -111,8 +110,7 @@ struct KARSTResolverNode {
   KARSTResolverNodeLocators locators KARST_GUARDED_BY(karstResolverCacheLock);
 };
 
-/* ---- Network interface
- * ------------------------------------------------------------------------------ */
+/* ---- Network interface ----------------------------------------------------------------------- */
 
 struct KARSTResolverNetIf {
   char tag[8]; /* complemented while the slot is free */
@@ -132,8 +130,7 @@ struct KARSTResolverNetIf {
   KarstHealthStatusEntry health KARST_GUARDED_BY(karstResolverCacheLock); /* all ones: no entry */
 };
 
-/* ---- Cache
- * ---------------------------------------------------------------------------------------------- */
+/* ---- Cache ----------------------------------------------------------------------------------- */
 
 struct KARSTResolverCache {
   char tag[8];
@@ -153,8 +150,7 @@ struct KARSTResolverCache {
   KARSTResolverLink dirtyNodes KARST_GUARDED_BY(karstResolverCacheLock);
 };
 
-/* ---- Instance
- * --------------------------------------------------------------------------------------------- */
+/* ---- Instance -------------------------------------------------------------------------------- */
 
 struct KARSTResolverInstance {
   char tag[8];
@@ -180,9 +176,7 @@ struct KARSTResolverInstance {
 };
 static_assert(sizeof(KARSTResolverInstance) == 392, "the heap is sized for this many bytes");
 
-/* ---- Module
- * -------------------------------------------------------------------------------------------------
- */
+/* ---- Module ---------------------------------------------------------------------------------- */
 
 extern "C" {
 
@@ -195,9 +189,7 @@ extern uint64_t karstResolverInstancesAlive;
 
 } /* extern "C" */
 
-/* ---- Locking
- * -------------------------------------------------------------------------------------------------
- */
+/* ---- Locking --------------------------------------------------------------------------------- */
 
 static inline void KARSTResolverLockCache(KARSTResolverCache *cache)
     KARST_ACQUIRES(karstResolverCacheLock) KARST_UNCHECKED {
@@ -219,8 +211,7 @@ static inline void KARSTResolverUnlockInstance(KARSTResolverInstance *instance)
   zel_SpinlockUnlock(instance->lock.handle);
 }
 
-/* ---- Atomic counts
- * ---------------------------------------------------------------------------------------------- */
+/* ---- Atomic counts --------------------------------------------------------------------------- */
 
 /* A reference is taken where another one, or the cache lock, keeps the object alive. */
 static inline void KARSTResolverCountUp(uint64_t *count) {

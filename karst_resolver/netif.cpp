@@ -8,8 +8,7 @@
 
 extern "C" {
 
-/* ---- Finding and creating
- * -------------------------------------------------------------------------- */
+/* ---- Finding and creating -------------------------------------------------------------------- */
 
 KARSTResolverNetIf *KARSTResolverFindNetIf(KARSTResolverCache *cache, zel_UUID nodeUUID,
                                            zel_UUID netIfUUID) {
@@ -56,8 +55,7 @@ KARSTResolverNetIf *KARSTResolverFindOrCreateNetIf(KARSTResolverCache *cache, ze
   return netIf;
 }
 
-/* ---- Reading entries
- * ----------------------------------------------------------------------------------- */
+/* ---- Reading entries ------------------------------------------------------------------------- */
 
 zel_Status KARSTResolverUpdateNetIf(KARSTResolverCache *cache, KARSTResolverNetIf *netIf) {
   KarstQuery query = {};
@@ -117,8 +115,7 @@ void KARSTResolverUpdateNetIfHealth(KARSTResolverCache *cache, KARSTResolverNetI
   KARSTResolverMarkNodeDirty(cache, netIf->node);
 }
 
-/* ---- Destroying
- * -------------------------------------------------------------------------------------------- */
+/* ---- Destroying ------------------------------------------------------------------------------ */
 
 void KARSTResolverReleaseNetIf(KARSTResolverCache *cache, KARSTResolverNetIf *netIf) {
   KARST_RESOLVER_CHECK(netIf->refCount != 0);
@@ -145,8 +142,7 @@ void KARSTResolverDestroyNetIf(KARSTResolverCache *cache, KARSTResolverNetIf *ne
   KARSTResolverReleaseNetIf(cache, netIf);
 }
 
-/* ---- The health subscription of one interface
- * ------------------------------------------------------------- */
+/* ---- The health subscription of one interface ------------------------------------------------ */
 
 zel_Status KARSTResolverNetIfHealthSubCbk(void *data, const KarstEntryHeader *, void *,
                                           zel_Status status) {
@@ -164,8 +160,7 @@ zel_Status KARSTResolverNetIfHealthSubCbk(void *data, const KarstEntryHeader *, 
   return ZEL_OK;
 }
 
-/* ---- The subscription to all interface entries
- * --------------------------------------------------------------- */
+/* ---- The subscription to all interface entries ----------------------------------------------- */
 
 /* Changes were lost: afterwards the cached interfaces are those that are there, below the owners
  * that they have, and can be read. Time: O(entries * (log nodes + a node's interfaces)). */

@@ -7,8 +7,7 @@
 
 extern "C" {
 
-/* ---- Finding and creating
- * ------------------------------------------------------------------------ */
+/* ---- Finding and creating -------------------------------------------------------------------- */
 
 KARSTResolverNode *KARSTResolverFindNodeLocked(KARSTResolverCache *cache, zel_UUID uuid) {
   KARSTRBTreeKey key = {};
@@ -41,8 +40,7 @@ KARSTResolverNode *KARSTResolverFindOrCreateNode(KARSTResolverCache *cache, zel_
   return node;
 }
 
-/* ---- Version
- * -------------------------------------------------------------------------------------- */
+/* ---- Version --------------------------------------------------------------------------------- */
 
 static zel_Status KARSTResolverFindNodeEntry(KARSTResolverNode *node,
                                              const KarstEntryHeader *header, KarstFullEntry **entry)
@@ -81,8 +79,7 @@ zel_Status KARSTResolverUpdateNodeVersionLocked(KARSTResolverNode *node,
   return ZEL_OK;
 }
 
-/* ---- Reachability, dirt, release
- * -------------------------------------------------------------------- */
+/* ---- Reachability, dirt, release ------------------------------------------------------------- */
 
 void KARSTResolverMarkNodeDirty(KARSTResolverCache *cache, KARSTResolverNode *node) {
   if (!cache->enabled) return; /* the world goes away, or is gone */
@@ -121,8 +118,7 @@ void KARSTResolverUpdateNodeHealthLocked(KARSTResolverCache *cache, KARSTResolve
   }
 }
 
-/* ---- The subscription to all node entries
- * ------------------------------------------------------------ */
+/* ---- The subscription to all node entries ---------------------------------------------------- */
 
 /* An entry exists: reachable, unless it cannot be read. */
 static void KARSTResolverNodeEntryFound(KARSTResolverCache *cache, KARSTResolverNode *node,

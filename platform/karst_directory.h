@@ -124,8 +124,7 @@ ZEL_STATIC_ASSERT(sizeof(KarstHealthStatusEntry) == 24, "layout of a health reco
 ZEL_STATIC_ASSERT(offsetof(KarstHealthStatusEntry, timestamp) == 8, "layout of a health record");
 ZEL_STATIC_ASSERT(offsetof(KarstHealthStatusEntry, healthReason) == 16, "health record");
 
-/* ---- Status of the directory ------------------------------------------------------------------
- */
+/* ---- Status of the directory ----------------------------------------------------------------- */
 
 #define KARST_STATUS_USABLE 0x1u
 
@@ -145,8 +144,7 @@ void KARST_DeregisterStatusCallback(KarstStatusFn fn, void *data);
 /* Stores this host's node UUID. Blocks: no. Under a spinlock: yes. */
 void KARST_GetSelfUUID(zel_UUID *uuid);
 
-/* ---- Subscriptions ------------------------------------------------------------------------------
- */
+/* ---- Subscriptions --------------------------------------------------------------------------- */
 
 /* A subscriber's callback, called on the directory's own threads, never from inside KARST_Subscribe
  * or KARST_Unsubscribe. Calls of one subscription never overlap and come in the order of the
@@ -171,8 +169,7 @@ zel_Status KARST_Subscribe(const KarstQuery *query, KarstSubscriptionFn fn, void
  * a spinlock: yes. */
 void KARST_Unsubscribe(const KarstQuery *query, KarstSubscriptionFn fn, void *data);
 
-/* ---- Lookups ------------------------------------------------------------------------------------
- */
+/* ---- Lookups --------------------------------------------------------------------------------- */
 
 /* Walks the entries that match, in ascending order of UUID. `next` 0 gives the first; `next` 1 the
  * one after the entry that `header` still names from the call before, whatever was added or removed

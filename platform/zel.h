@@ -31,7 +31,7 @@ extern "C" {
 #define ZEL_NORETURN
 #endif
 
-/* ---- Status ----------------------------------------------------------------------------- */
+/* ---- Status ---------------------------------------------------------------------------------- */
 
 typedef uint32_t zel_Status;
 
@@ -50,7 +50,7 @@ typedef uint32_t zel_Status;
  * reads "unknown status". Blocks: no. Under a spinlock: yes. */
 const char *zel_StatusToString(zel_Status status);
 
-/* ---- Identity, names, text ---------------------------------------------------------------- */
+/* ---- Identity, names, text ------------------------------------------------------------------- */
 
 typedef uint32_t zel_ModuleID;
 #define ZEL_NO_MODULE 0xffffffffu
@@ -80,7 +80,7 @@ void zel_NameInitialize(zel_Name *name, const char *text);
  * text has. Blocks: no. Under a spinlock: yes. */
 int zel_Snprintf(char *buffer, size_t size, const char *format, ...) ZEL_PRINTF(3, 4);
 
-/* ---- Heaps -------------------------------------------------------------------------------- */
+/* ---- Heaps ----------------------------------------------------------------------------------- */
 
 typedef uint64_t zel_HeapID;
 #define ZEL_NO_HEAP 0ull
@@ -117,7 +117,7 @@ void *zel_HeapAllocWithRA(zel_HeapID heap, uint32_t size, void *returnAddress);
  * stops the system. Blocks: no. Under a spinlock: yes. */
 void zel_HeapFree(zel_HeapID heap, void *block);
 
-/* ---- Lock domains and spinlocks ------------------------------------------------------------ */
+/* ---- Lock domains and spinlocks -------------------------------------------------------------- */
 
 typedef uint64_t zel_LockDomainID;
 #define ZEL_NO_LOCK_DOMAIN 0xffffffffffffffffull
@@ -169,7 +169,7 @@ void zel_SpinlockDestroy(zel_SpinlockHandle lock);
 void zel_SpinlockLock(zel_SpinlockHandle lock);
 void zel_SpinlockUnlock(zel_SpinlockHandle lock);
 
-/* ---- Log ----------------------------------------------------------------------------------- */
+/* ---- Log ------------------------------------------------------------------------------------- */
 
 /* A module's log, opened with Tolm_LogInit (tolm.h). Opaque. */
 typedef struct zel_Log zel_Log;
@@ -190,7 +190,7 @@ void zel_LogNoLevel(uint32_t urgency, const char *format, ...) ZEL_PRINTF(2, 3);
 const char *zel_LogGetName(zel_Log *log);
 int32_t zel_LogGetCurrentLogLevel(zel_Log *log);
 
-/* ---- Worlds --------------------------------------------------------------------------------- */
+/* ---- Worlds ---------------------------------------------------------------------------------- */
 
 /* A world is a kernel thread, created with TOLM_WorldCreate (tolm.h). */
 typedef uint32_t zel_WorldID;

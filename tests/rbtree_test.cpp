@@ -158,8 +158,7 @@ struct NumberTree {
   }
 };
 
-/* ---- Random steps against a model
- * ------------------------------------------------------------------ */
+/* ---- Random steps against a model ------------------------------------------------------------ */
 
 class MapModel : public ::testing::TestWithParam<uint64_t> {};
 
@@ -205,8 +204,7 @@ TEST_P(MapModel, HoldsAfterEveryStep) {
 /* The second base lies above every address: links are then negative numbers, wrapped. */
 INSTANTIATE_TEST_SUITE_P(Bases, MapModel, ::testing::Values(0, 0x1000, 0xfffffffffffff000));
 
-/* ---- Keys
- * -------------------------------------------------------------------------------------------- */
+/* ---- Keys ------------------------------------------------------------------------------------ */
 
 int compareUUIDs(std::array<uint8_t, 16> a, std::array<uint8_t, 16> b) {
   zel_UUID left, right;
@@ -291,8 +289,7 @@ TEST(MapKeysDeathTest, UnknownKindStopsTheSystemOnceItIsCompared) {
   EXPECT_DEATH(KARSTRBTree_AllocTree(), "");
 }
 
-/* ---- Values, ownership, ranges
- * -------------------------------------------------------------------------- */
+/* ---- Values, ownership, ranges --------------------------------------------------------------- */
 
 TEST(Map, EqualKeysStandInOrderOfInsertion) {
   NumberTree t;
@@ -416,8 +413,7 @@ TEST(Map, SwapExchangesContentsAndLeavesASharedNilAlone) {
   KARSTRBTree_FreeTree(d);
 }
 
-/* ---- Creation and its failures
- * ----------------------------------------------------------------------------- */
+/* ---- Creation and its failures --------------------------------------------------------------- */
 
 TEST(MapCreation, GivesBackWhatItHasWhenThePoolIsExhausted) {
   for (int failAt = 1; failAt <= 3; failAt++) {

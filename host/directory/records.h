@@ -1,4 +1,4 @@
-/* The directory's own records as bytes and back, through the marshaller. */
+/* The directory's own records as bytes and back, through the marshaller. No lock. */
 #pragma once
 
 #include <cstdint>
@@ -13,6 +13,9 @@ extern const ExprMshField nodeRecordTable[];
 extern const ExprMshField netInterfaceRecordTable[];
 extern const ExprMshField healthRecordTable[];
 
+/* What does not travel: the interface record's padding and networkPart, the bytes of an IPv4
+ * address behind its fourth, and the ipv4Address of a network type other than IP. An interface
+ * record with more than 7 addresses is nobody's to encode and stops the host. */
 std::vector<uint8_t> encode(const KarstNodeEntry &record);
 std::vector<uint8_t> encode(const KarstNetInterfaceEntry &record);
 std::vector<uint8_t> encode(const KarstHealthStatusEntry &record);

@@ -25,9 +25,9 @@ struct HeapBlock {
 };
 struct HeapState {
   std::string name;
-  uint32_t maximum;   /* bytes */
-  uint32_t used;      /* bytes that live blocks consume */
-  uint32_t peak;      /* most that was ever used */
+  uint32_t maximum; /* bytes */
+  uint32_t used;    /* bytes that live blocks consume */
+  uint32_t peak;    /* most that was ever used */
   uint64_t allocations;
   std::vector<HeapBlock> blocks; /* alive, oldest first */
 };

@@ -1,10 +1,13 @@
-/* Loads modules into this process and unloads them. */
+/* Loads modules into this process and unloads them.
+ *
+ * A module's dynamic symbols are visible to the modules that are loaded after it, so it shows only
+ * its entry points and its exports and hides the rest (-fvisibility=hidden).
+ */
 #pragma once
 
 #include <filesystem>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <vector>
 
@@ -15,6 +18,7 @@ namespace host {
 
 class Module {
  public:
+  ~Module();
   const std::string &name() const;
   const ModuleFile &file() const;
   zel_ModuleID id() const;
@@ -35,11 +39,10 @@ class Module {
   struct Impl;
   explicit Module(std::unique_ptr<Impl> impl);
   std::unique_ptr<Impl> impl_;
-
- public:
-  ~Module();
 };
 
+/* Loads and unloads are done one at a time; another thread's waits. init_module and cleanup_module
+ * run on the caller's thread and may call neither. */
 class ModuleLoader {
  public:
   /* `provided`: the namespaces that this host serves itself. `quiesce`: called after cleanup_module
@@ -47,11 +50,15 @@ class ModuleLoader {
   ModuleLoader(std::vector<Namespace> provided, std::function<void()> quiesce);
   ~ModuleLoader(); /* unloads what is still loaded, last first */
 
-  /* Maps, checks, sets NAME=VALUE parameters, calls init_module. Throws ModuleError; then nothing of
-   * the module remains. The returned module stays until unload. */
+  /* Checks, maps, sets NAME=VALUE parameters, calls init_module. VALUE of an int is decimal or 0x
+   * hexadecimal. Before anything is mapped: the namespaces that the module requires are provided,
+   * the ones it provides are not, each symbol that it lacks is the program's or an export of a
+   * loaded module, and the parameters are its own. Throws ModuleError; then nothing of the module
+   * remains. The returned module stays until unload. */
   Module &load(const std::filesystem::path &path, const std::vector<std::string> &parameters = {});
 
-  /* Calls cleanup_module and unmaps. Throws ModuleError when a loaded module uses its exports. */
+  /* Calls cleanup_module and unmaps. Throws ModuleError when a loaded module requires one of its
+   * namespaces or uses its exports, and then changes nothing. */
   void unload(Module &module);
 
   std::vector<const Module *> modules() const;
@@ -61,8 +68,8 @@ class ModuleLoader {
   std::unique_ptr<Impl> impl_;
 };
 
-/* "KARSTResolver_Create+0x42 in karst_resolver.so", or the bare address. Knows loaded modules (their
- * whole symbol tables) and the program. */
+/* "KARSTResolver_Create+0x42 in karst_resolver.so", or the bare address. Knows loaded modules
+ * (their whole symbol tables) and the program. */
 std::string symbolize(const void *address);
 
 }  // namespace host

@@ -24,6 +24,8 @@ std::string toString(const zel_UUID &uuid);
 /* Accepts 8-4-4-4-12 or 32 hexadecimal digits of either case; nothing else. */
 std::optional<zel_UUID> parseUUID(std::string_view text);
 
-inline bool isZero(const zel_UUID &uuid) { return uuid == zel_UUID{}; }
+inline bool isZero(const zel_UUID &uuid) {
+  return uuid == zel_UUID{};
+}
 
 }  // namespace host

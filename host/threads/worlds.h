@@ -12,12 +12,17 @@
 namespace host {
 
 struct WorldSettings {
-  std::chrono::milliseconds stopTimeout{30'000}; /* a stop that takes longer is fatal and says where */
-  std::chrono::microseconds lockSlice{2'000};    /* a lock held longer, with a waiter, is due */
+  /* A stop that takes longer is fatal: the report says which world hangs and where. */
+  std::chrono::milliseconds stopTimeout{30'000};
+  /* A lock that is held longer while somebody waits for it: its holder is asked to give way. */
+  std::chrono::microseconds lockSlice{2'000};
 };
+
+/* Takes effect at once, for stops and holds that begin later. Any thread, under any lock. */
 void configureWorlds(const WorldSettings &settings);
 
-/* Returns when every world sleeps in its wait with no wake-up pending. Not from a world. */
+/* Returns when every world sleeps in its wait with no wake-up pending, or has ended. Blocks; not
+ * from a world, which panics. */
 void waitUntilWorldsIdle();
 
 /* How often any world has been woken or has gone to sleep: unchanged between two idle moments means

@@ -1,0 +1,143 @@
+/* Token buckets. A bucket's whole state is the moment since which its tokens have been gathering:
+ * at one token an interval, a bucket whose moment lies n intervals back holds n tokens, and taking
+ * one moves the moment an interval on. So a take is one compare-and-swap, without a lock, and a
+ * refill needs nobody.
+ */
+#include "host/tracing/token_bucket.h"
+
+#include <algorithm>
+#include <atomic>
+#include <limits>
+
+namespace host {
+
+namespace {
+
+/* Earlier than any clock: a bucket that has gathered since then is full. */
+constexpr int64_t kSinceEver = std::numeric_limits<int64_t>::min();
+
+constexpr uint64_t kNever = std::numeric_limits<uint64_t>::max();
+
+/* A rate made ready for counting. */
+struct Gathering {
+  int64_t interval; /* ns between two tokens */
+  int64_t burst;
+  bool refills;
+};
+
+Gathering gatheringOf(const TokenRate &rate) {
+  constexpr uint64_t kSecond = 1'000'000'000;
+  const uint64_t interval =
+      rate.perSecond == 0 ? 1 : std::max<uint64_t>(kSecond / rate.perSecond, 1);
+  /* Keeps the moments of full buckets, and sums with them, inside the number's range. */
+  const uint64_t mostTokens =
+      static_cast<uint64_t>(std::numeric_limits<int64_t>::max() / 4) / interval;
+  return {static_cast<int64_t>(interval), static_cast<int64_t>(std::min(rate.burst, mostTokens)),
+          rate.perSecond != 0};
+}
+
+/* The time that refills go by. For a bucket without refills it stands still. */
+int64_t timeOf(const Gathering &gathering) {
+  if (!gathering.refills) return 0;
+  return static_cast<int64_t>(zel_TimerTCToNS(zel_GetTimerCycles()));
+}
+
+int64_t cappedMoment(int64_t moment, const Gathering &gathering, int64_t now) {
+  return std::max(moment, now - gathering.burst * gathering.interval);
+}
+
+uint64_t tokensSince(int64_t moment, const Gathering &gathering, int64_t now) {
+  /* Another thread, with a later clock, may have moved the moment beyond our now. */
+  return moment >= now ? 0 : static_cast<uint64_t>((now - moment) / gathering.interval);
+}
+
+bool useTokens(uint64_t &word, const Gathering &gathering, uint64_t tokens, uint64_t *left) {
+  const int64_t now = timeOf(gathering);
+  const std::atomic_ref<uint64_t> state(word);
+  uint64_t seen = state.load(std::memory_order_relaxed);
+  for (;;) {
+    const int64_t moment = cappedMoment(static_cast<int64_t>(seen), gathering, now);
+    const uint64_t available = tokensSince(moment, gathering, now);
+    if (tokens > available) {
+      *left = available;
+      return false;
+    }
+    const int64_t after = moment + static_cast<int64_t>(tokens) * gathering.interval;
+    if (state.compare_exchange_weak(seen, static_cast<uint64_t>(after),
+                                    std::memory_order_relaxed)) {
+      *left = available - tokens;
+      return true;
+    }
+  }
+}
+
+uint64_t timeToToken(uint64_t &word, const Gathering &gathering) {
+  const int64_t now = timeOf(gathering);
+  const auto stored = static_cast<int64_t>(std::atomic_ref(word).load(std::memory_order_relaxed));
+  const int64_t moment = cappedMoment(stored, gathering, now);
+  if (gathering.burst > 0 && tokensSince(moment, gathering, now) > 0) return 0;
+  if (gathering.burst == 0 || !gathering.refills) return kNever;
+  return static_cast<uint64_t>(moment + gathering.interval - now);
+}
+
+/* What all small buckets share; perTraceTbConfig stands for it. Changed only while nobody emits. */
+Gathering miniGathering{};
+
+/* The words of a full bucket: its state, then its rate. */
+enum FullBucketWord { kState, kInterval, kBurst, kRefills };
+
+Gathering gatheringOf(const TokenBucket &bucket) {
+  return {std::max<int64_t>(static_cast<int64_t>(bucket.opaque[kInterval]), 1),
+          static_cast<int64_t>(bucket.opaque[kBurst]), bucket.opaque[kRefills] != 0};
+}
+
+}  // namespace
+
+void setMiniBucketRate(const TokenRate &rate) {
+  miniGathering = gatheringOf(rate);
+}
+
+void initTokenBucket(TokenBucket &bucket, const TokenRate &rate) {
+  const Gathering gathering = gatheringOf(rate);
+  bucket = {};
+  bucket.opaque[kState] = static_cast<uint64_t>(kSinceEver);
+  bucket.opaque[kInterval] = static_cast<uint64_t>(gathering.interval);
+  bucket.opaque[kBurst] = static_cast<uint64_t>(gathering.burst);
+  bucket.opaque[kRefills] = gathering.refills ? 1 : 0;
+}
+
+uint64_t timeToToken(TokenBucket &bucket) {
+  return timeToToken(bucket.opaque[kState], gatheringOf(bucket));
+}
+
+uint64_t timeToToken(TokenBucketMini &bucket) {
+  return timeToToken(bucket.opaque[0], miniGathering);
+}
+
+}  // namespace host
+
+using namespace host;
+
+extern "C" {
+
+/* The small buckets' rate is set at run time and lives above; its address is what modules hand in.
+ */
+extern const unsigned char perTraceTbConfig[] = {0};
+
+void TokenBucket_InitMini(TokenBucketMini *bucket, const void *) {
+  *bucket = {};
+  bucket->opaque[0] = static_cast<uint64_t>(kSinceEver);
+}
+
+/* A small bucket that nobody has filled, all zero, counts as gathering since the clock's zero: full
+ * on a machine that has been up for a moment. */
+bool TokenBucket_UseTokensMini(TokenBucketMini *bucket, const void *, uint64_t tokens,
+                               uint64_t *out) {
+  return useTokens(bucket->opaque[0], miniGathering, tokens, out);
+}
+
+bool TokenBucket_UseTokens(TokenBucket *bucket, uint64_t tokens, uint64_t *out) {
+  return useTokens(bucket->opaque[kState], gatheringOf(*bucket), tokens, out);
+}
+
+}  // extern "C"

@@ -1,0 +1,80 @@
+/* What happened: the last platform calls, each with its fiber, its key argument and its result, in
+ * a ring of fixed size. One OS thread, no lock.
+ */
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+#include "sim/calls.h"
+#include "sim/fiber.h"
+
+namespace sim {
+
+/* What a call was about: a number, a UUID with its entry type, or a name. Never an address, which
+ * would differ between two equal runs. */
+class Argument {
+ public:
+  Argument() = default;
+  static Argument number(uint64_t value);
+  static Argument entry(uint8_t type, const zel_UUID &uuid);
+  static Argument text(const char *text); /* the first 31 characters */
+  static Argument name(const zel_Name &name);
+
+  uint64_t hash() const;
+  std::string toString() const;
+  bool operator==(const Argument &) const = default;
+
+ private:
+  enum class Kind : uint8_t { None, Number, Entry, Text };
+  Kind kind_ = Kind::None;
+  uint8_t type_ = 0;
+  uint64_t words_[4] = {};
+};
+
+struct HistoryEntry {
+  uint64_t step = 0; /* of the scheduler */
+  uint64_t time = 0; /* virtual nanoseconds */
+  uint32_t fiber = 0;
+  Call call{};
+  bool returned = false; /* else it goes on, or its fiber was abandoned in it */
+  bool injected = false; /* the result was made to be a failure */
+  uint64_t result = 0;   /* a status, a Boolean, a count; 0 for calls without a result */
+  Argument argument;
+  const std::string *fiberName = nullptr;
+  bool operator==(const HistoryEntry &other) const; /* all but the addresses */
+};
+
+class History {
+ public:
+  explicit History(size_t length); /* in calls; 0: keeps nothing */
+
+  /* A call begins; the number names it to end(). */
+  uint64_t begin(const HistoryEntry &entry) {
+    if (!ring_.empty()) ring_[made_ & mask_] = entry;
+    return made_++;
+  }
+  void end(uint64_t number, uint64_t result, bool injected) {
+    if (ring_.empty() || made_ - number > ring_.size()) return;
+    HistoryEntry &entry = ring_[number & mask_];
+    entry.result = result;
+    entry.injected = injected;
+    entry.returned = true;
+  }
+  void clear();
+
+  /* The last calls, oldest first. */
+  std::vector<HistoryEntry> entries() const;
+
+  /* The last `lines` of them as a table for people. */
+  std::string timeline(size_t lines) const;
+
+ private:
+  std::vector<HistoryEntry> ring_; /* a power of two */
+  uint64_t mask_ = 0;
+  uint64_t made_ = 0;
+  uint64_t cleared_ = 0; /* calls before this one are forgotten */
+};
+
+}  // namespace sim

@@ -1,0 +1,208 @@
+/* The platform's functions that are no worlds or spinlocks: each stops at a point of the scheduler,
+ * is written into the history, fails when it was asked to, and then does the host's own work.
+ */
+#include <cstdarg>
+#include <cstdio>
+
+#include "host/directory/directory.h"
+#include "host/directory/marshaller.h"
+#include "host/kernel/frames.h"
+#include "host/kernel/heap.h"
+#include "host/kernel/log.h"
+#include "host/kernel/panic.h"
+#include "host/kernel/text.h"
+#include "platform/karst_directory.h"
+#include "platform/qxt.h"
+#include "platform/tolm.h"
+#include "sim/platform_call.h"
+#include "sim/simulation.h"
+
+using namespace sim;
+
+namespace {
+
+host::Directory &directory() {
+  return Simulation::current().directory();
+}
+
+Argument subjectOf(const KarstQuery &query) {
+  return Argument::entry(query.type, query.uuid);
+}
+
+}  // namespace
+
+/* ---- Names, text ---------------------------------------------------------------------------- */
+
+extern "C" const char *zel_StatusToString(zel_Status status) {
+  PlatformCall call(Call::zel_StatusToString, Argument::number(status));
+  return host::statusText(status);
+}
+
+extern "C" void zel_NameInitialize(zel_Name *name, const char *text) {
+  PlatformCall call(Call::zel_NameInitialize, Argument::text(text));
+  host::fillName(name, text);
+}
+
+extern "C" int zel_Snprintf(char *buffer, size_t size, const char *format, ...) {
+  PlatformCall call(Call::zel_Snprintf, Argument::number(size));
+  va_list arguments;
+  va_start(arguments, format);
+  const int length = std::vsnprintf(buffer, size, format, arguments);
+  va_end(arguments);
+  return call.returns(length);
+}
+
+/* ---- Heaps --------------------------------------------------------------------------------------
+ */
+
+extern "C" zel_Status zel_HeapCreate(const zel_HeapProps *props, zel_HeapID *heap) {
+  PlatformCall call(Call::zel_HeapCreate, Argument::name(props->name));
+  if (call.fault()) return call.fault();
+  return call.returns(host::heapCreate(*props, heap));
+}
+
+extern "C" void zel_HeapDestroy(zel_HeapID heap) {
+  PlatformCall call(Call::zel_HeapDestroy);
+  host::heapDestroy(heap);
+}
+
+extern "C" void *zel_HeapAllocWithRA(zel_HeapID heap, uint32_t size, void *returnAddress) {
+  PlatformCall call(Call::zel_HeapAllocWithRA, Argument::number(size));
+  if (call.fault()) return nullptr;
+  void *block = host::heapAlloc(heap, size, returnAddress);
+  call.returns(block ? ZEL_OK : ZEL_NO_MEMORY);
+  return block;
+}
+
+extern "C" void zel_HeapFree(zel_HeapID heap, void *block) {
+  PlatformCall call(Call::zel_HeapFree);
+  host::heapFree(heap, block);
+}
+
+/* ---- Log, panic
+ * ----------------------------------------------------------------------------------- */
+
+extern "C" void zel_LogLevel(uint32_t urgency, zel_Log *log, int32_t level, const char *format,
+                             ...) {
+  PlatformCall call(Call::zel_LogLevel, Argument::text(format));
+  if (level > host::logLevel(log)) return;
+  va_list arguments;
+  va_start(arguments, format);
+  host::logVWrite(urgency, log, format, arguments);
+  va_end(arguments);
+}
+
+extern "C" void zel_LogNoLevel(uint32_t urgency, const char *format, ...) {
+  PlatformCall call(Call::zel_LogNoLevel, Argument::text(format));
+  va_list arguments;
+  va_start(arguments, format);
+  host::logVWrite(urgency, nullptr, format, arguments);
+  va_end(arguments);
+}
+
+extern "C" const char *zel_LogGetName(zel_Log *log) {
+  PlatformCall call(Call::zel_LogGetName);
+  return host::logName(log);
+}
+
+extern "C" int32_t zel_LogGetCurrentLogLevel(zel_Log *log) {
+  PlatformCall call(Call::zel_LogGetCurrentLogLevel);
+  return call.returns(host::logLevel(log));
+}
+
+extern "C" zel_Status Tolm_LogInit(const char *name, zel_ModuleID moduleID, uint32_t level,
+                                   uint32_t, zel_Log **log) {
+  PlatformCall call(Call::Tolm_LogInit, Argument::text(name));
+  if (call.fault()) return call.fault();
+  return call.returns(host::logOpen(name, moduleID, level, log));
+}
+
+extern "C" void Tolm_LogCleanup(zel_Log **log) {
+  PlatformCall call(Call::Tolm_LogCleanup);
+  host::logClose(log);
+}
+
+extern "C" void zel_PanicWithModuleID(zel_ModuleID moduleID, const char *format, ...) {
+  PlatformCall call(Call::zel_PanicWithModuleID, Argument::text(format));
+  va_list arguments;
+  va_start(arguments, format);
+  host::panicInModule(moduleID, format, arguments);
+}
+
+/* ---- Sizes, places, this host's role
+ * ------------------------------------------------------------- */
+
+extern "C" uint32_t tolmapi_HeapRequest2Size(uint32_t bytes) {
+  PlatformCall call(Call::tolmapi_HeapRequest2Size, Argument::number(bytes));
+  return call.returns(host::heapSpaceFor(bytes));
+}
+
+extern "C" uint32_t QXT_GetMaxAssocCount(void) {
+  PlatformCall call(Call::QXT_GetMaxAssocCount);
+  return call.returns(call.machine().settings().maxAssociations);
+}
+
+extern "C" uint64_t tolmapi_GetReturnAddress(uint32_t frame) {
+  PlatformCall call(Call::tolmapi_GetReturnAddress, Argument::number(frame));
+  /* Frame 0 is the caller's: the one that this function's own frame leads to. */
+  return host::returnAddressOf(__builtin_frame_address(0), frame + 1);
+}
+
+extern "C" bool TOLM_IsWitnessNode(void) {
+  PlatformCall call(Call::TOLM_IsWitnessNode);
+  return call.returns(call.machine().settings().witness);
+}
+
+/* ---- Directory, marshaller
+ * ------------------------------------------------------------------------ */
+
+extern "C" zel_Status KARST_RegisterStatusCallback(KarstStatusFn fn, void *data) {
+  PlatformCall call(Call::KARST_RegisterStatusCallback);
+  if (call.fault()) return call.fault();
+  return call.returns(directory().registerStatus(fn, data));
+}
+
+extern "C" void KARST_DeregisterStatusCallback(KarstStatusFn fn, void *data) {
+  PlatformCall call(Call::KARST_DeregisterStatusCallback);
+  directory().deregisterStatus(fn, data);
+}
+
+extern "C" void KARST_GetSelfUUID(zel_UUID *uuid) {
+  PlatformCall call(Call::KARST_GetSelfUUID);
+  *uuid = directory().self();
+}
+
+extern "C" zel_Status KARST_Subscribe(const KarstQuery *query, KarstSubscriptionFn fn, void *data) {
+  PlatformCall call(Call::KARST_Subscribe, subjectOf(*query));
+  if (call.fault()) return call.fault();
+  return call.returns(directory().subscribe(query, fn, data));
+}
+
+extern "C" void KARST_Unsubscribe(const KarstQuery *query, KarstSubscriptionFn fn, void *data) {
+  PlatformCall call(Call::KARST_Unsubscribe, subjectOf(*query));
+  directory().unsubscribe(query, fn, data);
+}
+
+extern "C" zel_Status KARST_FindEntry(const KarstQuery *query, uint32_t next,
+                                      KarstEntryHeader *header, uint32_t size) {
+  PlatformCall call(Call::KARST_FindEntry, subjectOf(*query));
+  if (call.fault()) return call.fault();
+  if (size != sizeof *header) return call.returns(ZEL_BAD_PARAM);
+  return call.returns(directory().findEntry(*query, next, header));
+}
+
+extern "C" zel_Status KARST_FindFullEntryByQuery(const KarstQuery *query, uint32_t,
+                                                 const ExprMshAllocator *allocator,
+                                                 KarstFullEntry **entry) {
+  PlatformCall call(Call::KARST_FindFullEntryByQuery, subjectOf(*query));
+  if (call.fault()) return call.fault();
+  return call.returns(directory().findFullEntry(*query, *allocator, entry));
+}
+
+extern "C" zel_Status KARST_FindFullEntryByHeader(const KarstEntryHeader *header, uint32_t,
+                                                  const ExprMshAllocator *allocator, uint32_t,
+                                                  KarstFullEntry **entry) {
+  PlatformCall call(Call::KARST_FindFullEntryByHeader, Argument::entry(0, header->uuid));
+  if (call.fault()) return call.fault();
+  return call.returns(directory().findFullEntry(*header, *allocator, entry));
+}

@@ -1,0 +1,51 @@
+/* Who decides what the simulated machine leaves open: which fiber runs next, who of several waiters
+ * is told, whether a preemption is due. Everything that differs between two runs of one program
+ * comes from here, so a run is repeated by repeating the answers.
+ */
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <span>
+
+namespace sim {
+
+class Fiber;
+
+class Strategy {
+ public:
+  Strategy() = default;
+  virtual ~Strategy() = default;
+  Strategy(const Strategy &) = delete;
+  Strategy &operator=(const Strategy &) = delete;
+
+  /* The fiber that runs next, out of `runnable` (never empty; in the order in which they became
+   * runnable). `current` is the one that ran last, null when it cannot go on. */
+  virtual Fiber &next(std::span<Fiber *const> runnable, Fiber *current) = 0;
+
+  /* Any other free choice: a number below `count`, which is at least 1. */
+  virtual size_t pick(size_t count) = 0;
+};
+
+/* A fiber runs until it blocks, then comes the one that has been runnable for longest. For tests
+ * that a person can follow step by step. */
+class RunOn final : public Strategy {
+ public:
+  Fiber &next(std::span<Fiber *const> runnable, Fiber *current) override;
+  size_t pick(size_t count) override;
+};
+
+/* At every step any runnable fiber, each as likely as the others. */
+class RandomWalk final : public Strategy {
+ public:
+  explicit RandomWalk(uint64_t seed) : state_(seed) {}
+  Fiber &next(std::span<Fiber *const> runnable, Fiber *current) override;
+  size_t pick(size_t count) override;
+
+ private:
+  uint64_t random(); /* splitmix64 */
+  uint64_t state_;
+};
+
+}  // namespace sim

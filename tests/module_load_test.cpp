@@ -1,0 +1,272 @@
+/* Loading, every failure of loading, unloading; the module's memory; what it declares. */
+#include "host/kernel/module_file.h"
+#include "platform/tolm.h"
+#include "tests/module_fixture.h"
+
+using sim::Call;
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+using ::testing::IsEmpty;
+
+namespace {
+
+class Load : public ModuleTest {};
+
+TEST_F(Load, BuildsInOrderAndUnloadsInReverse) {
+  const auto life = {Call::Tolm_LogInit,
+                     Call::zel_HeapCreate,
+                     Call::zel_LockDomainCreate,
+                     Call::zel_SpinlockCreate,
+                     Call::KARST_RegisterStatusCallback,
+                     Call::KARST_DeregisterStatusCallback,
+                     Call::zel_SpinlockDestroy,
+                     Call::zel_LockDomainDestroy,
+                     Call::zel_HeapDestroy,
+                     Call::Tolm_LogCleanup};
+  ASSERT_EQ(load(), "");
+  EXPECT_EQ(sim.uses(Call::TokenBucket_InitMini), 19u);
+  unload();
+  EXPECT_THAT(calls(life),
+              ElementsAre("Tolm_LogInit", "zel_HeapCreate", "zel_LockDomainCreate",
+                          "zel_SpinlockCreate", "KARST_RegisterStatusCallback",
+                          "KARST_DeregisterStatusCallback", "zel_SpinlockDestroy",
+                          "zel_LockDomainDestroy", "zel_HeapDestroy", "Tolm_LogCleanup"));
+  EXPECT_THAT(sim.alive(), IsEmpty());
+}
+
+/* Whatever fails, once or from there on: its report, nothing left behind, and success afterwards.
+ */
+TEST_F(Load, FailsCleanlyAtEveryStep) {
+  struct Row {
+    Call call;
+    uint64_t nth;
+    std::vector<std::string> report;
+  };
+  const std::string name = "2 KARSTResolver: ";
+  const Row rows[] = {
+      {Call::Tolm_LogInit, 1, {}},
+      {Call::zel_HeapCreate,
+       1,
+       {name + "KARSTResolverInit:N: Failed to create heap: ZEL_NO_MEMORY"}},
+      {Call::zel_LockDomainCreate,
+       1,
+       {name + "KARSTResolverInit:N: Failed to create lock domain: ZEL_NO_MEMORY"}},
+      {Call::zel_HeapAllocWithRA, 1, {}}, /* the cache itself */
+      {Call::zel_SpinlockCreate,
+       1,
+       {name + "KARSTResolverCacheInit:N: Failed to create spinlock: ZEL_NO_MEMORY"}},
+      {Call::zel_HeapAllocWithRA,
+       2,
+       {name + "KARSTResolverCacheInit:N: Failed to allocate node pool"}},
+      {Call::zel_HeapAllocWithRA,
+       3,
+       {name + "KARSTResolverCacheInit:N: Failed to allocate netif pool"}},
+      {Call::zel_HeapAllocWithRA,
+       4,
+       {name + "KARSTResolverCacheInit:N: Failed to allocate node rbtree"}},
+      {Call::zel_HeapAllocWithRA,
+       5,
+       {name + "KARSTResolverCacheInit:N: Failed to allocate node rbtree"}},
+      {Call::zel_HeapAllocWithRA,
+       6,
+       {name + "KARSTResolverCacheInit:N: Failed to allocate node rbtree"}},
+      {Call::KARST_RegisterStatusCallback,
+       1,
+       {name + "KARSTResolverCacheInit:N: Failed to register KARST status callback"}},
+  };
+  for (const Row &row : rows) {
+    for (uint64_t count : {uint64_t{1}, sim::Machine::everyFurther}) {
+      SCOPED_TRACE(std::string(sim::traits(row.call).name) + " at " + std::to_string(row.nth));
+      uint64_t before = sim.faultsInjected();
+      sim.failAt(row.call, row.nth, count);
+      EXPECT_NE(load(), "");
+      EXPECT_GT(sim.faultsInjected(), before);
+      EXPECT_EQ(log, row.report);
+      EXPECT_THAT(sim.alive(), IsEmpty());
+      sim.clearFaults();
+      log.clear();
+    }
+  }
+  EXPECT_EQ(load(), "");
+}
+
+TEST_F(Load, SpinlockFailureKeepsItsStatus) {
+  sim.failAt(Call::zel_SpinlockCreate, 1, 1, 0x0bad0999);
+  EXPECT_NE(load(), "");
+  EXPECT_THAT(log, ElementsAre(HasSubstr("Failed to create spinlock: unknown status")));
+}
+
+/* ---- The heap's maximum size ----------------------------------------------------------------- */
+
+uint32_t heapMaximum() {
+  return host::heapState(host::heapsAlive().at(0)).maximum;
+}
+
+class HeapSize : public ModuleTest {
+ protected:
+  static sim::Settings associations(uint32_t count) {
+    sim::Settings settings = defaults();
+    settings.maxAssociations = count;
+    return settings;
+  }
+  explicit HeapSize(uint32_t count) : ModuleTest(associations(count)) {}
+  static uint32_t perAssociation() {
+    return tolmapi_HeapRequest2Size(392) + zel_SpinlockAllocSize(1);
+  }
+};
+struct HeapSizeNone : HeapSize {
+  HeapSizeNone() : HeapSize(0) {}
+};
+struct HeapSizeMany : HeapSize {
+  HeapSizeMany() : HeapSize(40000) {}
+};
+struct HeapSizeWrapping : HeapSize {
+  HeapSizeWrapping() : HeapSize(0x80000000) {}
+};
+
+TEST_F(HeapSizeNone, DefaultParameterWins) {
+  ASSERT_EQ(load(), "");
+  EXPECT_EQ(heapMaximum(), 0xa00000u);
+}
+
+TEST_F(HeapSizeNone, AnyLargerParameterWins) {
+  ASSERT_EQ(load({"KARST_RESOLVER_LEAST_MAX_HEAP=0xa00001"}), "");
+  EXPECT_EQ(heapMaximum(), 0xa00001u);
+  unload();
+  ASSERT_EQ(load({"KARST_RESOLVER_LEAST_MAX_HEAP=-1"}), "") << "a very large unsigned size";
+  EXPECT_EQ(heapMaximum(), 0xffffffffu);
+  unload();
+  ASSERT_EQ(load({"KARST_RESOLVER_LEAST_MAX_HEAP=5242880"}), "") << "a tie";
+  EXPECT_EQ(heapMaximum(), 0x500000u);
+}
+
+TEST_F(HeapSizeMany, RoomForEachAssociation) {
+  ASSERT_EQ(load({"KARST_RESOLVER_LEAST_MAX_HEAP=1"}), "");
+  EXPECT_EQ(heapMaximum(), sim.call("reader", [] { return 40000 * perAssociation(); }) + 0x500000);
+}
+
+TEST_F(HeapSizeWrapping, ThirtyTwoBits) {
+  ASSERT_EQ(load(), "");
+  uint32_t product = 0x80000000u * sim.call("reader", [] { return perAssociation(); });
+  EXPECT_EQ(heapMaximum(), std::max<uint32_t>(product + 0x500000, 0xa00000));
+}
+
+/* ---- Memory ---------------------------------------------------------------------------------- */
+
+class Memory : public ModuleTest {
+ protected:
+  void SetUp() override { ASSERT_EQ(load(), ""); }
+  zel_HeapID heap() { return host::heapsAlive().at(0); }
+};
+
+/* The block stands where a dirty one was. */
+void *dirtied(zel_HeapID heap, uint32_t size) {
+  void *block = host::heapAlloc(heap, size, nullptr);
+  std::memset(block, 0xee, size);
+  host::heapFree(heap, block);
+  return block;
+}
+
+TEST_F(Memory, BlocksAreZeroedOverWhatWasAskedFor) {
+  auto *alloc = internal<void *(uint32_t)>("KARSTResolverAlloc");
+  auto *release = internal<void(void *)>("KARSTResolverFree");
+  dirtied(heap(), 32);
+  auto *block = static_cast<uint8_t *>(sim.call("caller", [&] { return alloc(7); }));
+  for (int i = 0; i < 7; i++) EXPECT_EQ(block[i], 0) << i;
+  sim.call("caller", [&] { release(block); });
+}
+
+struct EntryPoints {
+  void *(*alloc)(uint32_t);
+  const KARSTMemPool *pool;
+  const ExprMshAllocator *msh;
+};
+
+/* Two calls of one entry point, and one of each other; nothing else in here. */
+__attribute__((noinline)) void askForBlocks(const EntryPoints &from, void **blocks) {
+  blocks[0] = from.alloc(8);
+  blocks[1] = from.alloc(8);
+  blocks[2] = from.pool->alloc(nullptr, 0x100000008);
+  blocks[3] = from.pool->calloc(nullptr, 2, 4);
+  blocks[4] = from.msh->alloc(nullptr, 8);
+  blocks[5] = from.msh->zeroedAlloc(nullptr, 8);
+}
+
+TEST_F(Memory, RecordsTheCallerNotItself) {
+  EntryPoints from{
+      internal<void *(uint32_t)>("KARSTResolverAlloc"),
+      static_cast<const KARSTMemPool *>(module().anySymbol("karstResolverMemPool")),
+      static_cast<const ExprMshAllocator *>(module().anySymbol("resolverMshAlloc")),
+  };
+  size_t before = host::heapState(heap()).blocks.size();
+  std::array<void *, 6> blocks;
+  sim.call("caller", [&] { askForBlocks(from, blocks.data()); });
+  auto recorded = host::heapState(heap()).blocks;
+  recorded.erase(recorded.begin(), recorded.begin() + static_cast<long>(before));
+  ASSERT_EQ(recorded.size(), blocks.size());
+  auto *previous = reinterpret_cast<uint8_t *>(&askForBlocks);
+  for (size_t i = 0; i < blocks.size(); i++) {
+    EXPECT_EQ(recorded[i].address, blocks[i]);
+    EXPECT_EQ(recorded[i].size, 8u);
+    auto *address = static_cast<uint8_t *>(recorded[i].returnAddress);
+    EXPECT_GT(address, previous) << "behind the call before, in the function that called";
+    EXPECT_LT(address, previous + 512);
+    previous = address;
+  }
+  sim.call("caller", [&] {
+    EXPECT_EQ(from.pool->calloc(nullptr, 0x10000, 0x10000), nullptr) << "does not fit in 32 bits";
+    for (void *block : blocks) from.msh->free(nullptr, block);
+    from.msh->free(nullptr, nullptr); /* nothing */
+  });
+  EXPECT_EQ(host::heapState(heap()).blocks.size(), before);
+}
+
+/* Inside the module: the cache's blocks name the functions that asked. */
+TEST_F(Memory, CachesBlocksNameTheirFunctions) {
+  std::vector<std::string> askers;
+  for (const host::HeapBlock &block : host::heapState(heap()).blocks) {
+    std::string symbol = host::symbolize(block.returnAddress);
+    askers.push_back(symbol.substr(0, symbol.find("+0x")));
+  }
+  EXPECT_THAT(askers, ::testing::IsSupersetOf({std::string("KARSTResolverCacheInit"),
+                                               std::string("KARSTRBTree_CreateTreeData")}));
+}
+
+TEST_F(Memory, ReallocStopsTheSystem) {
+  auto *pool = static_cast<const KARSTMemPool *>(module().anySymbol("karstResolverMemPool"));
+  EXPECT_DEATH(sim.call("caller", [&] { pool->realloc(nullptr, nullptr, 1); }),
+               "Failed at karst_resolver/karst_resolver_util:[0-9]+ -- NOT REACHED");
+}
+
+/* ---- Declaration ----------------------------------------------------------------------------- */
+
+TEST(Declaration, IsTheOneAgreedUpon) {
+  host::ModuleFile file(KARST_RESOLVER_SO);
+  EXPECT_THAT(
+      file.declaration,
+      ElementsAre("param_KARST_RESOLVER_LEAST_MAX_HEAP:int",
+                  "nsRequired=com.tarvik.tracing#0.0.0.1", "nsRequired=com.tarvik.qxt#0.0.0.1",
+                  "nsRequired=com.tarvik.tolmutil#0.0.0.1", "nsRequired=com.tarvik.karst#0.0.0.1",
+                  "nsProvides=com.tarvik.karst.resolver#0.0.0.1",
+                  "param_desc_KARST_RESOLVER_LEAST_MAX_HEAP=Min heap size in bytes (default: 10MB)",
+                  "nsRequired=com.tarvik.tolmapi#0.0.0.2", "nsRequired=com.tarvik.zelapi#v2_4_0_0",
+                  "nsRequired=com.tarvik.zelapi.incompat#v2_4_0_0"));
+  std::vector<std::string> required;
+  for (const host::Namespace &name : file.required)
+    required.push_back(name.name + "#" + name.version);
+  EXPECT_THAT(required, ElementsAre("com.tarvik.tracing#0.0.0.1", "com.tarvik.qxt#0.0.0.1",
+                                    "com.tarvik.tolmutil#0.0.0.1", "com.tarvik.karst#0.0.0.1",
+                                    "com.tarvik.tolmapi#0.0.0.2", "com.tarvik.zelapi#v2_4_0_0",
+                                    "com.tarvik.zelapi.incompat#v2_4_0_0"));
+  EXPECT_THAT(file.exports,
+              ElementsAre("KARSTResolver_GetNodeLocators", "KARSTResolver_SetCallback",
+                          "KARSTResolver_Destroy", "KARSTResolver_Create"));
+  ASSERT_EQ(file.parameters.size(), 1u);
+  EXPECT_EQ(file.parameters[0].name, "KARST_RESOLVER_LEAST_MAX_HEAP");
+  EXPECT_EQ(file.parameters[0].type, 1u);
+  ASSERT_EQ(file.assertions.size(), 1u);
+  EXPECT_EQ(file.assertions[0].kind, 1u);
+  EXPECT_EQ(file.assertions[0].source, "karst/karst_rbtree_impl");
+}
+
+}  // namespace

@@ -13,7 +13,7 @@
 #define DECLARE(section_name) __attribute__((section(section_name), used))
 #define ENTRY __attribute__((visibility("default")))
 
-/* ---- What the loader reads ----------------------------------------------------------------- */
+/* ---- What the loader reads ------------------------------------------------------------------- */
 
 #define NS_RESOLVER "com.tarvik.karst.resolver#0.0.0.1"
 #define NS_KARST "com.tarvik.karst#0.0.0.1"
@@ -51,7 +51,7 @@ static const struct ParameterRecord parameters[] = {
     {"CLIENT_USE_LOCAL_LOCATOR", 1, &useLocalLocator, {0, 0}},
 };
 
-/* ---- What the module does ------------------------------------------------------------------ */
+/* ---- What the module does -------------------------------------------------------------------- */
 
 static zel_HeapID heap = ZEL_NO_HEAP;
 static zel_WorldID reader = ZEL_NO_WORLD;

@@ -46,7 +46,8 @@ class Kernel {
   ModuleLoader &modules();
 
   /* Returns when all that was told to the directory so far has reached every subscriber and every
-   * world has finished what that gave it to do. Not from a callback or a world. */
+   * world has finished what that gave it to do. What a source has yet to notice is not waited for.
+   * Not from a callback or a world. */
   void settle();
 
   /* All that is alive: modules, worlds, locks, domains, heaps and their blocks, subscriptions,

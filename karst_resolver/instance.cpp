@@ -107,7 +107,7 @@ uint32_t KARSTResolverReadState(KARSTResolverInstance *instance) {
 
 /* ---- Release --------------------------------------------------------------------------------- */
 
-__attribute__((noinline)) void KARSTResolverReleaseInstance(KARSTResolverInstance *instance) {
+KARST_RESOLVER_RECORDS_CALLER void KARSTResolverReleaseInstance(KARSTResolverInstance *instance) {
   uint64_t before = KARSTResolverCountDown(&instance->refCount);
   KARST_RESOLVER_TRACE(ReleaseInstance, 384, KARST_RESOLVER_TRACE_POINTER(instance), before,
                        KARST_RESOLVER_TRACE_POINTER(__builtin_return_address(0)),

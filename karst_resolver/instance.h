@@ -23,7 +23,7 @@ void KARSTResolverRefreshNodeLocation(KARSTResolverInstance *instance, KARSTReso
 
 /* Gives one reference back; with the last one the instance is freed. Records where it is called
  * from: not to be inlined. The cache lock may be held. */
-__attribute__((noinline)) void KARSTResolverReleaseInstance(KARSTResolverInstance *instance)
+KARST_RESOLVER_RECORDS_CALLER void KARSTResolverReleaseInstance(KARSTResolverInstance *instance)
     KARST_EXCLUDES(instance->lock);
 
 /* The instance's state at this moment. */

@@ -76,9 +76,8 @@ typedef struct KARSTResolverInstance KARSTResolverInstance;
  *
  * It may come on the resolver's own thread, on a directory thread, or on the thread that calls
  * SetCallback; calls of one instance never overlap. It runs under the instance's spinlock, so it
- * must be short, must not sleep, and must not call
- *   - SetCallback, GetNodeLocators or Destroy for its own instance,
- *   - Create or Destroy for any instance.
+ * must be short, must not sleep, and must call none of the four functions, for this instance (it
+ * would lock against itself) or any other (locks of equal or lower rank would be taken under it).
  * Note that something changed, wake a thread of your own and read the locators there. */
 typedef void (*KARSTResolverCallback)(void *callbackData, KARSTResolverInstance *instance,
                                       uint32_t state);

@@ -12,7 +12,11 @@
 #include "platform/expr_msh.h"
 #include "platform/zel.h"
 
+#if __has_attribute(no_icf)
+#define KARST_RESOLVER_RECORDS_CALLER __attribute__((noinline, no_icf))
+#else
 #define KARST_RESOLVER_RECORDS_CALLER __attribute__((noinline))
+#endif
 
 extern "C" {
 

@@ -51,16 +51,20 @@
  *                           trace emission, zel_WorldForceWakeup, and the subscription and
  *                           cancellation of health subscriptions, none of which may block. Never
  *                           held across a client's callback.
- *   rank 2  instance lock   the instance's state, locators, callback and destroyed flag; the
- * locators and the state are written under both. Held across the client's callback. The reference
- * counts of the cache and of instances are atomic, those of nodes and interfaces plain.
+ *   rank 2  instance lock   the instance's state, locators, callback and destroyed flag. Locators and
+ *                           state are written under both locks and read under this one alone. Held
+ *                           across the client's callback.
+ * The reference counts of the cache and of instances are atomic, those of nodes and interfaces plain.
  *
- * Reads without a lock, each on its own thread's terms:
- *   instance->node, nodeChanged, destroyed   quick looks in tracking and its traces, atomic; what
- * gets past them is decided again under the lock instance->boundNodeUUID written once, by the first
- * tracking inside Create, before any other thread can track the instance; and it is the UUID of any
- * node it is attached to cache->world            read and written atomically: created before, and
- * destroyed after, anyone can need to wake it
+ * Read without a lock:
+ *   instance->node          quick looks in tracking, and in its traces; atomic. What gets past them
+ *   instance->nodeChanged   is decided again under the lock. The node itself is never read so.
+ *   instance->destroyed
+ *   instance->boundNodeUUID written once, by the first tracking inside Create, before any other
+ *                           thread can track the instance; it is the UUID of whichever node the
+ *                           instance is attached to
+ *   cache->world            atomic; the host stores it before the world first runs
+ *   cache->nodeSub, netIfSub, netIf->healthSub   constant from before the subscription on
  */
 #ifndef KARST_RESOLVER_MODEL_H
 #define KARST_RESOLVER_MODEL_H

@@ -56,8 +56,8 @@ static zel_Status KARSTResolverCreateLockDomain(void) {
   return status;
 }
 
-/* Takes down whatever loading has built, in the reverse order: the cache holds the domain's only
- * locks and most of the heap, and may still log. */
+/* Takes down whatever loading has built, in the reverse order: the cache's lock is the domain's
+ * last one, most of the heap is the cache's, and it may still log. */
 static void KARSTResolverCleanup(void) {
   if (karstResolverCache != nullptr) {
     KARSTResolverCacheCleanup(karstResolverCache);

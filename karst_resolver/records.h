@@ -1,5 +1,6 @@
 /* What the module asks of the directory: the field tables of the three records, queries, and
- * fetching with decoding. No lock of its own; the callers hold the cache lock. */
+ * fetching with decoding. No lock of its own: lookups and decoding are made under
+ * the cache lock, a query is filled while nobody else knows it. */
 #ifndef KARST_RESOLVER_RECORDS_H
 #define KARST_RESOLVER_RECORDS_H
 
@@ -18,7 +19,8 @@ void KARSTResolverFillQuery(KarstQuery *query, uint8_t type, uint8_t flags, cons
 void KARSTResolverFreeEntry(KarstFullEntry *entry);
 
 /* Zeroes `record`, of `size` bytes, decodes the entry's data into it and gives the entry back,
- * whatever came of it. The marshaller's status; the record counts only where it is ZEL_OK. */
+ * whatever came of it. The marshaller's status; where that is not ZEL_OK, the record holds what was
+ * read before the fault. */
 zel_Status KARSTResolverDecodeEntry(KarstFullEntry *entry, const ExprMshField *table,
                                     const char *name, void *record, uint32_t size);
 

@@ -39,7 +39,9 @@ ZEL_STATIC_ASSERT(sizeof(ExprMshAllocator) == 32, "layout of the allocator recor
 #define EXPR_MSH_TRAILING 0x0bad0202u     /* bytes follow the record */
 #define EXPR_MSH_BAD_TYPE 0x0bad0203u     /* a value is not of the field's type */
 #define EXPR_MSH_OUT_OF_RANGE 0x0bad0204u /* a number, length or count does not fit the field */
-#define EXPR_MSH_MALFORMED 0x0bad0205u    /* not well-formed CBOR, or no map, or nested too deep */
+/* Not well-formed CBOR, no map, nested too deep, a field that stands twice, or a name that is not
+ * text in one piece. */
+#define EXPR_MSH_MALFORMED 0x0bad0205u
 
 /* Writers and readers of records in progress; the marshaller's own. */
 typedef struct ExprMshWriter ExprMshWriter;

@@ -16,10 +16,9 @@ extern "C" {
 /* ---- Entries --------------------------------------------------------------------------------- */
 
 /* Types of entries that carry a record known here. An object's type is its user's. */
-#define KARST_TYPE_NODE 3u /* UUID: the node's; KarstNodeEntry */
-#define KARST_TYPE_NET_INTERFACE \
-  6u /* UUID: the interface's, owner: its node; KarstNetInterfaceEntry */
-#define KARST_TYPE_HEALTH_STATUS 7u /* UUID: the interface's; KarstHealthStatusEntry */
+#define KARST_TYPE_NODE 3u          /* KarstNodeEntry; UUID: the node's */
+#define KARST_TYPE_NET_INTERFACE 6u /* KarstNetInterfaceEntry; UUID: its own, owner: its node */
+#define KARST_TYPE_HEALTH_STATUS 7u /* KarstHealthStatusEntry; UUID: the interface's */
 
 typedef struct KarstEntryHeader {
   zel_UUID uuid;

@@ -84,8 +84,8 @@ bool TokenBucket_UseTokensMini(TokenBucketMini *bucket, const void *config, uint
                                uint64_t *out);
 bool TokenBucket_UseTokens(TokenBucket *bucket, uint64_t tokens, uint64_t *out);
 
-/* Time until the bucket has a token again, in nanoseconds; 0 when it has one. Serves both kinds;
- * a small bucket is told from a full one by its address. */
+/* Time until the bucket has a token again, in nanoseconds; 0 when it has one, all ones when it never
+ * will. Serves both kinds; a small bucket is told from a full one by its address. */
 uint64_t TokenBucket_TimeToGetTokens(void *bucket);
 
 /* Trace ids of the two kinds of throttle notice. */

@@ -10,7 +10,7 @@
 
 namespace sim {
 
-/* ---- Arguments ---------------------------------------------------------------------------- */
+/* ---- Arguments ------------------------------------------------------------------------------- */
 
 Argument Argument::number(uint64_t value) {
   Argument argument;
@@ -80,7 +80,7 @@ std::string resultText(const HistoryEntry &entry) {
 
 }  // namespace
 
-/* ---- The ring ------------------------------------------------------------------------------- */
+/* ---- The ring -------------------------------------------------------------------------------- */
 
 bool HistoryEntry::operator==(const HistoryEntry &other) const {
   return step == other.step && time == other.time && fiber == other.fiber && call == other.call &&

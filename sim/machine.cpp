@@ -49,7 +49,7 @@ Machine &Machine::current() {
   return *onlyMachine;
 }
 
-/* ---- Running ------------------------------------------------------------------------------ */
+/* ---- Running --------------------------------------------------------------------------------- */
 
 Task Machine::spawn(const std::string &name, std::function<void()> body) {
   auto ended = std::make_shared<bool>(false);
@@ -112,8 +112,7 @@ void Machine::settleAndRequireNothingLeft() {
   host::panic("%s", text.c_str());
 }
 
-/* ---- Failures and preemption ------------------------------------------------------------------
- */
+/* ---- Failures and preemption ----------------------------------------------------------------- */
 
 void Machine::failAt(Call call, uint64_t nth, uint64_t count, std::optional<zel_Status> status) {
   if (traits(call).fault == ZEL_OK) host::panic("%s cannot fail", traits(call).name);
@@ -136,8 +135,7 @@ bool Machine::answersPreemption() {
   return preemption_ == Preemption::Random && scheduler_.pick(2) == 1;
 }
 
-/* ---- Around every platform call ----------------------------------------------------------------
- */
+/* ---- Around every platform call -------------------------------------------------------------- */
 
 PlatformCall::PlatformCall(Call call, const Argument &argument)
     : machine_(Machine::current()), fiber_(machine_.scheduler_.running()) {

@@ -69,7 +69,7 @@ class Machine {
 
   const Settings &settings() const { return settings_; }
 
-  /* ---- Running. From outside every fiber, except spawn(). ---- */
+  /* ---- Running. From outside every fiber, except spawn(). ------------------------------------ */
 
   /* Starts a fiber; it runs in run(), step() and the like. An exception that leaves `body` comes
    * out of the function that ran it. */
@@ -112,7 +112,7 @@ class Machine {
   /* Runs all that is to do within this span of virtual time, and ends at its end. */
   void advance(std::chrono::nanoseconds duration);
 
-  /* ---- Failures and preemption. ---- */
+  /* ---- Failures and preemption. -------------------------------------------------------------- */
 
   static constexpr uint64_t everyFurther = UINT64_MAX;
 
@@ -130,7 +130,7 @@ class Machine {
    * always gets a no, which does not count. */
   void forcePreemption(uint64_t times) { forcedPreemptions_ = times; }
 
-  /* ---- What happened. ---- */
+  /* ---- What happened. ------------------------------------------------------------------------ */
 
   std::vector<HistoryEntry> history() const { return history_.entries(); }
   void clearHistory() { history_.clear(); }
@@ -145,7 +145,7 @@ class Machine {
    * logs; a line each. Empty when everything was given back. */
   virtual std::vector<std::string> alive() const;
 
-  /* ---- For the platform's functions. ---- */
+  /* ---- For the platform's functions. --------------------------------------------------------- */
 
   Scheduler &scheduler() { return scheduler_; }
   LockTable &locks() { return locks_; }

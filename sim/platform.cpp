@@ -31,7 +31,7 @@ Argument subjectOf(const KarstQuery &query) {
 
 }  // namespace
 
-/* ---- Names, text ---------------------------------------------------------------------------- */
+/* ---- Names, text ----------------------------------------------------------------------------- */
 
 extern "C" const char *zel_StatusToString(zel_Status status) {
   PlatformCall call(Call::zel_StatusToString, Argument::number(status));
@@ -52,8 +52,7 @@ extern "C" int zel_Snprintf(char *buffer, size_t size, const char *format, ...) 
   return call.returns(length);
 }
 
-/* ---- Heaps --------------------------------------------------------------------------------------
- */
+/* ---- Heaps ----------------------------------------------------------------------------------- */
 
 extern "C" zel_Status zel_HeapCreate(const zel_HeapProps *props, zel_HeapID *heap) {
   PlatformCall call(Call::zel_HeapCreate, Argument::name(props->name));
@@ -79,8 +78,7 @@ extern "C" void zel_HeapFree(zel_HeapID heap, void *block) {
   host::heapFree(heap, block);
 }
 
-/* ---- Log, panic
- * ----------------------------------------------------------------------------------- */
+/* ---- Log, panic ------------------------------------------------------------------------------ */
 
 extern "C" void zel_LogLevel(uint32_t urgency, zel_Log *log, int32_t level, const char *format,
                              ...) {
@@ -129,8 +127,7 @@ extern "C" void zel_PanicWithModuleID(zel_ModuleID moduleID, const char *format,
   host::panicInModule(moduleID, format, arguments);
 }
 
-/* ---- Sizes, places, this host's role
- * ------------------------------------------------------------- */
+/* ---- Sizes, places, this host's role --------------------------------------------------------- */
 
 extern "C" uint32_t tolmapi_HeapRequest2Size(uint32_t bytes) {
   PlatformCall call(Call::tolmapi_HeapRequest2Size, Argument::number(bytes));
@@ -153,8 +150,7 @@ extern "C" bool TOLM_IsWitnessNode(void) {
   return call.returns(call.machine().settings().witness);
 }
 
-/* ---- Directory, marshaller
- * ------------------------------------------------------------------------ */
+/* ---- Directory, marshaller ------------------------------------------------------------------- */
 
 extern "C" zel_Status KARST_RegisterStatusCallback(KarstStatusFn fn, void *data) {
   PlatformCall call(Call::KARST_RegisterStatusCallback);

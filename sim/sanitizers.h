@@ -32,9 +32,9 @@ namespace sim::sanitizers {
 
 /* Instrumented frames are several times as large. */
 #if defined(SIM_ADDRESS_SANITIZER) || defined(SIM_THREAD_SANITIZER)
-inline constexpr size_t stackSize = 1024 * 1024;
+inline constexpr size_t stackSize = size_t{1024} * 1024;
 #else
-inline constexpr size_t stackSize = 256 * 1024;
+inline constexpr size_t stackSize = size_t{256} * 1024;
 #endif
 
 /* Address sanitizer: around every switch. `fakeStack` is the place where the fiber that is left

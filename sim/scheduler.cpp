@@ -31,7 +31,7 @@ const std::string *intern(const std::string &name) {
 
 }  // namespace
 
-/* ---- Stacks ------------------------------------------------------------------------------- */
+/* ---- Stacks ---------------------------------------------------------------------------------- */
 
 Stack::Stack() {
   boost::context::protected_fixedsize_stack allocator(sanitizers::stackSize);
@@ -53,7 +53,7 @@ void Stack::clean() {
   sanitizers::stackCleaned(bottom_, size());
 }
 
-/* ---- Reports ------------------------------------------------------------------------------ */
+/* ---- Reports --------------------------------------------------------------------------------- */
 
 std::string Fiber::describe() const {
   if (ended_) return "has ended";
@@ -76,7 +76,7 @@ void Scheduler::reportDeadlock(const char *headline) const {
   host::panic("%s", text.c_str());
 }
 
-/* ---- Making and ending fibers --------------------------------------------------------------- */
+/* ---- Making and ending fibers ---------------------------------------------------------------- */
 
 Scheduler::Scheduler(std::unique_ptr<Strategy> strategy) : strategy_(std::move(strategy)) {
   if (instance_) host::panic("a second simulation while the first one is still there");
@@ -161,7 +161,7 @@ void Scheduler::reap(Fiber &fiber) {
   fibers_.erase(place);
 }
 
-/* ---- Switching ------------------------------------------------------------------------------ */
+/* ---- Switching ------------------------------------------------------------------------------- */
 
 void Scheduler::switchTo(Fiber &next) {
   Fiber &previous = *current_;
@@ -199,8 +199,7 @@ void Scheduler::leave() {
   if (next != &fiber) switchTo(next ? *next : driver_);
 }
 
-/* ---- Who can run ------------------------------------------------------------------------------
- */
+/* ---- Who can run ----------------------------------------------------------------------------- */
 
 void Scheduler::addRunnable(Fiber &fiber) {
   if (fiber.ready_ && !fiber.heldBack_ && &fiber != &driver_) runnable_.push_back(&fiber);
@@ -272,12 +271,13 @@ void Scheduler::wakeAll(WaitQueue &queue) {
 void Scheduler::wakeAny(WaitQueue &queue) {
   size_t waiters = 0;
   for (Fiber *fiber = queue.first; fiber; fiber = fiber->nextInQueue_) ++waiters;
-  if (waiters == 0) return;
-  Fiber *chosen = queue.first;
-  for (size_t skip = waiters > 1 ? pick(waiters) : 0; skip > 0; --skip)
-    chosen = chosen->nextInQueue_;
-  unqueue(*chosen);
-  setReady(*chosen);
+  size_t skip = waiters > 1 ? pick(waiters) : 0;
+  for (Fiber *fiber = queue.first; fiber; fiber = fiber->nextInQueue_) {
+    if (skip-- > 0) continue;
+    unqueue(*fiber);
+    setReady(*fiber);
+    return;
+  }
 }
 
 size_t Scheduler::pick(size_t count) {
@@ -286,8 +286,7 @@ size_t Scheduler::pick(size_t count) {
   return choice;
 }
 
-/* ---- Holding back -------------------------------------------------------------------------------
- */
+/* ---- Holding back ---------------------------------------------------------------------------- */
 
 bool Scheduler::heldByName(const Fiber &fiber) const {
   return std::any_of(heldPrefixes_.begin(), heldPrefixes_.end(),
@@ -313,8 +312,7 @@ void Scheduler::release(const std::string &namePrefix) {
   }
 }
 
-/* ---- Driving ------------------------------------------------------------------------------------
- */
+/* ---- Driving --------------------------------------------------------------------------------- */
 
 bool Scheduler::advanceTime(uint64_t limit) {
   uint64_t earliest = never;

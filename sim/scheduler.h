@@ -26,7 +26,7 @@ class Scheduler {
   /* The one that exists; null when none does. */
   static Scheduler *current() { return instance_; }
 
-  /* ---- What runs on the machine asks. ---- */
+  /* ---- What runs on the machine asks. -------------------------------------------------------- */
 
   Fiber &running() { return *current_; }
   bool driving() const { return current_ == &driver_; }
@@ -56,7 +56,7 @@ class Scheduler {
 
   uint64_t now() const { return now_; } /* virtual nanoseconds */
 
-  /* ---- What the driver asks; not from a fiber. ---- */
+  /* ---- What the driver asks; not from a fiber. ----------------------------------------------- */
 
   /* What ends a drive before all is quiet. */
   struct Limits {

@@ -97,4 +97,8 @@ Thread::~Thread() {
     scheduler().block(impl_->joiners, {.what = "the end of", .object = impl_->name.c_str()});
 }
 
+const void *Thread::current() {
+  return &scheduler().running();
+}
+
 }  // namespace host

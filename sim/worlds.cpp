@@ -93,8 +93,7 @@ std::vector<std::string> aliveWorldsAndLocks() {
 
 }  // namespace host
 
-/* ---- The platform's functions ------------------------------------------------------------------
- */
+/* ---- The platform's functions ---------------------------------------------------------------- */
 
 using namespace sim;
 

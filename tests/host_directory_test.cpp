@@ -165,8 +165,7 @@ std::vector<uint8_t> walk(const Directory &directory, const KarstQuery &query,
   return numbers;
 }
 
-/* ---- Lookups -----------------------------------------------------------------------------------
- */
+/* ---- Lookups --------------------------------------------------------------------------------- */
 
 TEST(DirectoryLookup, WalksOneTypeInOrderOfUuid) {
   Directory directory;
@@ -286,8 +285,7 @@ TEST(DirectoryLookup, GoesOnWhileACallbackDoesNotReturn) {
   directory.waitUntilIdle();
 }
 
-/* ---- What subscribers are told
- * ------------------------------------------------------------------- */
+/* ---- What subscribers are told --------------------------------------------------------------- */
 
 TEST(DirectoryDelivery, WhatIsThereThenEveryChangeInOrder) {
   Directory directory;
@@ -427,8 +425,7 @@ TEST(DirectoryDelivery, CallbacksMaySubscribeAndUnsubscribe) {
   }
 }
 
-/* ---- Overflow and resynchronisation -------------------------------------------------------------
- */
+/* ---- Overflow and resynchronisation ---------------------------------------------------------- */
 
 TEST(DirectoryOverflow, IsToldOnceAndDeliveryGoesOn) {
   Directory directory({2, 3});
@@ -563,8 +560,7 @@ TEST(DirectoryOverflow, WhoeverRescansLosesNothing) {
   directory.waitUntilIdle();
 }
 
-/* ---- Cancellation
- * -------------------------------------------------------------------------------- */
+/* ---- Cancellation ---------------------------------------------------------------------------- */
 
 TEST(DirectoryCancel, DropsWhatIsDueAndEndsWithOneLastCall) {
   Directory directory;
@@ -648,8 +644,7 @@ TEST(DirectoryCancel, RacesWithDelivery) {
   EXPECT_EQ(directory.subscriptions(), 0u);
 }
 
-/* ---- Status callbacks
- * ----------------------------------------------------------------------------- */
+/* ---- Status callbacks ------------------------------------------------------------------------ */
 
 class StatusListener {
  public:
@@ -832,8 +827,7 @@ TEST(DirectoryStatus, LongCallbackDoesNotHoldUpSubscriptions) {
   listener.end();
 }
 
-/* ---- The end
- * -------------------------------------------------------------------------------------- */
+/* ---- The end --------------------------------------------------------------------------------- */
 
 TEST(DirectoryEnd, MakesLastCallsAndReportsWhatIsStillInstalled) {
   std::vector<std::string> lines;

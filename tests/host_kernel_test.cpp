@@ -79,7 +79,7 @@ class TestHeap {
   zel_HeapID id_ = ZEL_NO_HEAP;
 };
 
-/* ---- UUIDs and text ------------------------------------------------------------------------ */
+/* ---- UUIDs and text -------------------------------------------------------------------------- */
 
 TEST(UUID, IsReadAndPrintedInByteOrder) {
   const auto uuid = host::parseUUID("00112233-4455-6677-8899-aAbBcCdDeEfF");
@@ -130,7 +130,7 @@ TEST(Text, FormatsLikeC99) {
   EXPECT_STREQ(buffer, "karst-1");
 }
 
-/* ---- Heaps --------------------------------------------------------------------------------- */
+/* ---- Heaps ----------------------------------------------------------------------------------- */
 
 TEST(Heap, HoldsExactlyWhatTheSizingFunctionSays) {
   for (const uint32_t size : {0u, 1u, 15u, 16u, 17u, 392u, 4096u}) {
@@ -256,7 +256,7 @@ TEST(HeapDeathTest, StopsOnBlocksThatAreNotAlive) {
   heap.free(block);
 }
 
-/* ---- Log ----------------------------------------------------------------------------------- */
+/* ---- Log ------------------------------------------------------------------------------------- */
 
 TEST(Log, GoesToStandardErrorWithLevelThreadAndOneNewline) {
   testing::internal::CaptureStderr();

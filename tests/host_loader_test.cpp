@@ -88,7 +88,7 @@ class Loader : public testing::Test {
   }
 };
 
-/* ---- The file ------------------------------------------------------------------------------ */
+/* ---- The file -------------------------------------------------------------------------------- */
 
 TEST(ModuleFile, TellsItsDeclaration) {
   const host::ModuleFile file(modulePath("provider"));
@@ -184,7 +184,7 @@ TEST(ModuleFile, MangledBytesAreReadOrRefusedButDoNoHarm) {
   EXPECT_GT(refused, 300u); /* the mangling reaches what is read */
 }
 
-/* ---- Load ---------------------------------------------------------------------------------- */
+/* ---- Load ------------------------------------------------------------------------------------ */
 
 TEST_F(Loader, CallsInitWithAnIDOfItsOwnThenCleanupAndQuiesceBeforeUnmapping) {
   host::Module &module = loader.load(modulePath("provider"));
@@ -336,7 +336,7 @@ TEST(LoaderDeathTest, AModuleThatCannotLeaveIsFatal) {
       "stays.so stays in the process after its unload");
 }
 
-/* ---- Symbols ------------------------------------------------------------------------------- */
+/* ---- Symbols --------------------------------------------------------------------------------- */
 
 TEST_F(Loader, NamesAddressesOfModulesWhileTheyAreLoaded) {
   host::Module &module = loader.load(modulePath("provider"));

@@ -84,8 +84,7 @@ const std::string interfaceWire =
     "\"numIpAddresses\" 82 44 c0000201 50 20000000000000000000000000000007"
     "\"trafficTypeMask\" 1b ffffffffffffffff";
 
-/* ---- The wire ----------------------------------------------------------------------------------
- */
+/* ---- The wire -------------------------------------------------------------------------------- */
 
 TEST(MarshallerWire, NodeRecord) {
   const KarstNodeEntry record{6, 24, KARST_NODE_FLAG_WITNESS, 256, 65536};
@@ -140,8 +139,7 @@ TEST(MarshallerWire, Ipv4AddressMayStandBeforeTheType) {
   EXPECT_THAT(decoded.ipv4Address, testing::ElementsAre(1, 2, 3, 4));
 }
 
-/* ---- What readers accept -----------------------------------------------------------------------
- */
+/* ---- What readers accept --------------------------------------------------------------------- */
 
 TEST(MarshallerReading, MissingFieldsStayAndTheOrderIsFree) {
   KarstNodeEntry record{1, 2, 3, 4, 5};
@@ -212,8 +210,7 @@ TEST(MarshallerReading, NestingHasABound) {
   EXPECT_EQ(host::decode(wire("a1 \"x\"" + siblings), &record), ZEL_OK);
 }
 
-/* ---- What is refused, and why -------------------------------------------------------------------
- */
+/* ---- What is refused, and why ---------------------------------------------------------------- */
 
 struct Refusal {
   const char *bytes;
@@ -327,8 +324,7 @@ TEST(MarshallerRefusal, IsReportedWithTheRecordsName) {
   EXPECT_THAT(lines, testing::ElementsAre(testing::HasSubstr("KarstNodeEntry")));
 }
 
-/* ---- Any record, any damage
- * ---------------------------------------------------------------------- */
+/* ---- Any record, any damage ------------------------------------------------------------------ */
 
 class MarshallerProperties : public testing::Test {
  protected:

@@ -32,8 +32,7 @@ using testing::ElementsAre;
 using testing::HasSubstr;
 using testing::IsEmpty;
 
-/* ---- Shorthand: UUIDs that end in two digits of choice
- * -------------------------------------------- */
+/* ---- Shorthand: UUIDs that end in two digits of choice --------------------------------------- */
 
 std::string uuidText(const std::string &end) {
   return "00000000-0000-4000-8000-0000000000" + end;
@@ -94,8 +93,7 @@ std::vector<std::string> addressTexts(const KarstNetInterfaceEntry &record) {
   return texts;
 }
 
-/* ---- The cluster file: what is refused, where, and in which words
- * ---------------------------------- */
+/* ---- The cluster file: what is refused, where, and in which words ---------------------------- */
 
 struct RefusalCase {
   const char *name;
@@ -264,8 +262,7 @@ TEST(ClusterFileRefusals, AFileThatCannotBeReadIsNamedWithTheReason) {
   EXPECT_THROW(host::parseClusterFile("/"), host::ClusterFileError);
 }
 
-/* ---- The cluster file: what a good one means
- * ------------------------------------------------------ */
+/* ---- The cluster file: what a good one means ------------------------------------------------- */
 
 TEST(ClusterFile, NodesBecomeEntriesThatOwnThemselves) {
   const auto content = parse(R"({"$schema":"cluster.schema.json","self":@a2,"nodes":[
@@ -388,8 +385,7 @@ TEST(ClusterFile, TheExampleShowsEverythingThatItIsThereToShow) {
   EXPECT_EQ(objectTypes.size(), 2u);
 }
 
-/* ---- Differences
- * ---------------------------------------------------------------------------------- */
+/* ---- Differences ----------------------------------------------------------------------------- */
 
 Entry entry(uint8_t type, const std::string &end, uint8_t data = 0) {
   return {type, uuid(end), uuid("a1"), {data}};
@@ -414,8 +410,7 @@ TEST(Difference, BuildsFromTheGroundUpAndTakesDownFromTheTop) {
       ElementsAre(entry(0, "c1"), entry(9, "c2"), entry(3, "a1"), entry(6, "b1"), entry(7, "b1")));
 }
 
-/* ---- Reloads
- * -------------------------------------------------------------------------------------- */
+/* ---- Reloads --------------------------------------------------------------------------------- */
 
 /* Calls from other threads, taken one by one. */
 template <typename Call>
@@ -602,8 +597,7 @@ TEST_F(ClusterFileReload, AFolderThatCannotBeWatchedIsAnError) {
   EXPECT_THROW(elsewhere.watch([](const host::Reload &) {}), std::system_error);
 }
 
-/* ---- UUIDs that are not stored
- * -------------------------------------------------------------------- */
+/* ---- UUIDs that are not stored --------------------------------------------------------------- */
 
 class MachineUUID : public testing::Test {
  protected:
@@ -642,8 +636,7 @@ TEST(NamedUUID, FollowsFromOwnerAndNameAlone) {
   EXPECT_NE(host::namedUUID(dns, "eth0"), host::namedUUID(uuid("a1"), "eth0"));
 }
 
-/* ---- This machine's interfaces
- * -------------------------------------------------------------------- */
+/* ---- This machine's interfaces --------------------------------------------------------------- */
 
 host::OwnAddress own(const std::string &text, bool local = false, bool passing = false) {
   host::OwnAddress result;

@@ -84,7 +84,7 @@ class Threads : public testing::Test {
   uint32_t usedAtStart = 0;
 };
 
-/* ---- Spinlocks ---- */
+/* ---- Spinlocks ------------------------------------------------------------------------------- */
 
 using Spinlocks = Threads;
 
@@ -189,7 +189,7 @@ TEST_F(Spinlocks, LeftBehindAreReportedByTheirDomainAndReleased) {
   EXPECT_EQ(used(), 0u);
 }
 
-/* ---- What is fatal with spinlocks ---- */
+/* ---- What is fatal with spinlocks ------------------------------------------------------------ */
 
 class SpinlocksDeathTest : public Threads {
  protected:
@@ -313,7 +313,7 @@ TEST_F(SpinlocksDeathTest, EndOfAThreadUnderALock) {
                mentions({"ends", "leaver", "\"First\""}));
 }
 
-/* ---- Preemption ---- */
+/* ---- Preemption ------------------------------------------------------------------------------ */
 
 class Preemption : public Threads {
  protected:
@@ -388,7 +388,7 @@ TEST_F(Preemption, AsksTheHolderOnlyNotOthers) {
   });
 }
 
-/* ---- Worlds ---- */
+/* ---- Worlds ---------------------------------------------------------------------------------- */
 
 class Worlds : public Threads {
  protected:
@@ -613,7 +613,7 @@ TEST_F(Worlds, RunOnAProcessorThatExists) {
   EXPECT_LT(tolmapi_GetPCPUNumPreemptible(), sysconf(_SC_NPROCESSORS_CONF));
 }
 
-/* ---- What is fatal with worlds ---- */
+/* ---- What is fatal with worlds --------------------------------------------------------------- */
 
 class WorldsDeathTest : public Worlds {
  protected:
@@ -729,7 +729,7 @@ TEST_F(WorldsDeathTest, WaitForIdleWorldsInAWorld) {
                mentions({"\"Doomed\"", "itself among them"}));
 }
 
-/* ---- The host's own threads ---- */
+/* ---- The host's own threads ------------------------------------------------------------------ */
 
 TEST_F(Threads, HandWorkOverThroughAMutexAndACondition) {
   host::Mutex mutex;

@@ -92,7 +92,7 @@ class Tracing : public testing::Test {
   Tracing() { host::configureTracing({}); }
 };
 
-/* ---- The stream ---- */
+/* ---- The stream ------------------------------------------------------------------------------ */
 
 TEST_F(Tracing, HasAStreamBeforeAnyConfiguration) {
   ASSERT_NE(streamAtStart, nullptr);
@@ -195,7 +195,7 @@ TEST_F(Tracing, ReadsNoTornRecordWhileEmittersRun) {
   EXPECT_EQ(torn, 0);
 }
 
-/* ---- Classes, ids ---- */
+/* ---- Classes, ids ---------------------------------------------------------------------------- */
 
 TEST_F(Tracing, SetsClassLevelsOneByOne) {
   host::configureTracing({.classLevel = 2});
@@ -219,7 +219,7 @@ TEST_F(Tracing, NoticeIdsDifferAndFitTheirField) {
   EXPECT_LT(Trace_GetGlobalThrottledTraceId(), 1u << 14);
 }
 
-/* ---- Buckets ---- */
+/* ---- Buckets --------------------------------------------------------------------------------- */
 
 /* Both kinds by one interface: four tokens of burst, one token back every 250 ms. */
 struct SmallBucket {
@@ -383,7 +383,7 @@ TEST_F(Tracing, ASmallBucketThatNobodyFilledGathersFromTheClocksZero) {
   EXPECT_EQ(left, 3u);
 }
 
-/* ---- Readers' services ---- */
+/* ---- Readers' services ----------------------------------------------------------------------- */
 
 TEST_F(Tracing, TiesEvery2048thRecordToTheWallClock) {
   const auto before =

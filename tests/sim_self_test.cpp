@@ -88,7 +88,7 @@ struct CountingWorld {
   void stop() { TOLM_WorldDestroy(&id); }
 };
 
-/* ---- One seed, one course ------------------------------------------------------------------ */
+/* ---- One seed, one course -------------------------------------------------------------------- */
 
 struct Course {
   uint64_t hash;
@@ -182,8 +182,7 @@ TEST(Switching, WhenBlockedRunsEachFiberAsFarAsItCan) {
   EXPECT_EQ(order, "aabbccabc");
 }
 
-/* ---- Locks ------------------------------------------------------------------------------------
- */
+/* ---- Locks ----------------------------------------------------------------------------------- */
 
 TEST(Spinlock, LetsOneFiberInAtATime) {
   for (uint64_t seed = 1; seed <= 100; ++seed) {
@@ -324,8 +323,7 @@ TEST(SpinlockDeath, SaysWhoHoldsADestroyedLock) {
                "\"lock a\" is destroyed while culprit holds it");
 }
 
-/* ---- Deadlocks --------------------------------------------------------------------------------
- */
+/* ---- Deadlocks ------------------------------------------------------------------------------- */
 
 /* Two mutexes, two fibers, each holds one and wants the other. */
 void embrace() {
@@ -390,8 +388,7 @@ TEST(DeadlockDeath, SaysWhatIsLeftBehind) {
       "test\n  heap test: 2 blocks");
 }
 
-/* ---- Quiescence -------------------------------------------------------------------------------
- */
+/* ---- Quiescence ------------------------------------------------------------------------------ */
 
 TEST(Quiescence, IsReachedWithIdleWaiters) {
   Machine machine;
@@ -522,8 +519,7 @@ TEST(Fiber, FramePointersEndWhereItsStackDoes) {
   });
 }
 
-/* ---- Time -------------------------------------------------------------------------------------
- */
+/* ---- Time ------------------------------------------------------------------------------------ */
 
 TEST(Time, SleepersWakeInTheOrderOfTheirTimes) {
   Machine machine;
@@ -573,7 +569,7 @@ TEST(Time, AdvanceGoesExactlySoFar) {
   EXPECT_EQ(machine.now(), 300ms);
 }
 
-/* ---- Holding back --------------------------------------------------------------------------- */
+/* ---- Holding back ---------------------------------------------------------------------------- */
 
 TEST(Holding, KeepsFibersOfTheNameFromRunning) {
   Machine machine;
@@ -640,8 +636,7 @@ TEST(Holding, StepsLeadFromPointToPoint) {
   EXPECT_EQ(passed, 3);
 }
 
-/* ---- Worlds -----------------------------------------------------------------------------------
- */
+/* ---- Worlds ---------------------------------------------------------------------------------- */
 
 TEST(World, NoWakeUpIsLostInAnyOrder) {
   for (uint64_t seed = 1; seed <= 300; ++seed) {
@@ -769,8 +764,7 @@ TEST(World, PreemptionNeverSaysYesTwiceRunning) {
   for (const std::string &answer : seen) EXPECT_THAT(answer, testing::Not(HasSubstr("yy")));
 }
 
-/* ---- Failures on demand ------------------------------------------------------------------------
- */
+/* ---- Failures on demand ---------------------------------------------------------------------- */
 
 TEST(Faults, ComeAtExactlyTheUseAsked) {
   Machine machine;
@@ -823,8 +817,7 @@ TEST(FaultsDeath, OnlyForCallsThatCanFail) {
       "zel_SpinlockLock cannot fail");
 }
 
-/* ---- History -----------------------------------------------------------------------------------
- */
+/* ---- History --------------------------------------------------------------------------------- */
 
 TEST(History, KeepsTheLastCallsAndSaysWhoDidWhat) {
   Machine machine({.historyLength = 4});
@@ -841,8 +834,7 @@ TEST(History, KeepsTheLastCallsAndSaysWhoDidWhat) {
   EXPECT_TRUE(machine.history().empty());
 }
 
-/* ---- The whole ---------------------------------------------------------------------------------
- */
+/* ---- The whole ------------------------------------------------------------------------------- */
 
 struct Seen {
   std::vector<zel_Status> statuses;

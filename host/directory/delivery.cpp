@@ -3,39 +3,11 @@
  */
 #include "host/directory/delivery.h"
 
-#include <unwind.h>
-
 #include <algorithm>
-#include <cstdint>
 #include <limits>
 #include <string>
 
 namespace host {
-namespace {
-
-struct StackWalk {
-  uintptr_t frame;
-  bool belowFrame;
-  bool found;
-};
-
-_Unwind_Reason_Code visitFrame(_Unwind_Context *context, void *argument) {
-  StackWalk &walk = *static_cast<StackWalk *>(argument);
-  const bool below = _Unwind_GetCFA(context) <= walk.frame;
-  walk.found = walk.belowFrame && !below;
-  walk.belowFrame = below;
-  return walk.found ? _URC_NORMAL_STOP : _URC_NO_REASON;
-}
-
-/* Whether the caller was called, however indirectly, from the frame. Asked of the stack itself and
- * not of a thread-local variable, because threads of the simulator share those. */
-bool calledFrom(const void *frame) {
-  StackWalk walk{reinterpret_cast<uintptr_t>(frame), false, false};
-  _Unwind_Backtrace(visitFrame, &walk);
-  return walk.found;
-}
-
-}  // namespace
 
 Delivery::Delivery(Mutex &mutex, unsigned threads)
     : mutex_(mutex), running_(std::max(threads, 1u), 0) {
@@ -73,9 +45,9 @@ void Delivery::work(size_t worker) {
     /* What was due may have been dropped since. */
     if (recipient->due()) {
       running_[worker] = ++calls_;
-      recipient->stack_ = __builtin_frame_address(0);
+      recipient->caller_ = Thread::current();
       recipient->serve(lock);
-      recipient->stack_ = nullptr;
+      recipient->caller_ = nullptr;
       running_[worker] = 0;
       schedule(recipient);
     }
@@ -102,7 +74,7 @@ void Delivery::waitForCallbacks(std::unique_lock<Mutex> &lock) {
 }
 
 void Delivery::waitUntilReturned(const Recipient &recipient, std::unique_lock<Mutex> &lock) {
-  if (!recipient.running() || calledFrom(recipient.stack_)) return;
+  if (recipient.caller_ == Thread::current()) return;
   while (recipient.running()) {
     returned_.wait(lock, {"until a callback of the directory has returned", false});
   }

@@ -23,7 +23,7 @@ class Recipient {
 
   /* Both are called with the lock held. */
   virtual bool due() const = 0;
-  bool running() const { return stack_ != nullptr; }
+  bool running() const { return caller_ != nullptr; }
 
  private:
   friend class Delivery;
@@ -31,8 +31,8 @@ class Recipient {
   /* Makes the next call, without the lock, which is held before and after. Something is due. */
   virtual void serve(std::unique_lock<Mutex> &lock) = 0;
 
-  bool listed_ = false;         /* in the ready list */
-  const void *stack_ = nullptr; /* while a call runs: the frame below which it runs */
+  bool listed_ = false;          /* in the ready list */
+  const void *caller_ = nullptr; /* while a call runs: the thread that makes it */
 };
 
 /* The delivery threads. A recipient with calls due stands in the ready list; a thread makes one

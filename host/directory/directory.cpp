@@ -176,8 +176,7 @@ zel_UUID Directory::self() const {
   return impl_->self;
 }
 
-/* ---- Status ------------------------------------------------------------------------------------
- */
+/* ---- Status ---------------------------------------------------------------------------------- */
 
 void Directory::setUsable(bool usable) {
   const std::lock_guard<Mutex> lock(impl_->mutex);
@@ -219,8 +218,7 @@ void Directory::deregisterStatus(KarstStatusFn fn, void *data) {
   });
 }
 
-/* ---- Changes -----------------------------------------------------------------------------------
- */
+/* ---- Changes --------------------------------------------------------------------------------- */
 
 void Directory::put(Entry entry) {
   const auto present = std::make_shared<const Entry>(std::move(entry));
@@ -251,8 +249,7 @@ void Directory::resync() {
   }
 }
 
-/* ---- Subscriptions ------------------------------------------------------------------------------
- */
+/* ---- Subscriptions --------------------------------------------------------------------------- */
 
 zel_Status Directory::subscribe(const KarstQuery *query, KarstSubscriptionFn fn, void *data) {
   if (query == nullptr || fn == nullptr) return ZEL_BAD_PARAM;
@@ -285,8 +282,7 @@ void Directory::unsubscribe(const KarstQuery *query, KarstSubscriptionFn fn, voi
   impl_->delivery.schedule(subscription);
 }
 
-/* ---- Lookups ------------------------------------------------------------------------------------
- */
+/* ---- Lookups --------------------------------------------------------------------------------- */
 
 zel_Status Directory::findEntry(const KarstQuery &query, uint32_t next,
                                 KarstEntryHeader *header) const {
@@ -317,8 +313,7 @@ zel_Status Directory::findFullEntry(const KarstEntryHeader &header,
   return copyWhole(impl_->exactly(*key), allocator, entry);
 }
 
-/* ---- Reports and waits --------------------------------------------------------------------------
- */
+/* ---- Reports and waits ----------------------------------------------------------------------- */
 
 std::optional<Entry> Directory::entry(uint8_t type, const zel_UUID &uuid) const {
   const SharedEntry found = impl_->exactly(Key{type, uuid});

@@ -42,7 +42,7 @@ class Directory {
   Directory(const Directory &) = delete;
   Directory &operator=(const Directory &) = delete;
 
-  /* ---- What sources do. Any thread; never blocks on delivery. ---- */
+  /* ---- What sources do. Any thread; never blocks on delivery. -------------------------------- */
 
   void setSelf(const zel_UUID &uuid);
 
@@ -59,7 +59,7 @@ class Directory {
   /* Tells every subscription ZEL_SUB_RESYNC in place of what it has due. */
   void resync();
 
-  /* ---- What modules do (behind the KARST_ functions; statuses as there). ---- */
+  /* ---- What modules do (behind the KARST_ functions; statuses as there). --------------------- */
 
   zel_Status registerStatus(KarstStatusFn fn, void *data);
   /* Waits for a call of the pair that runs, unless it is called from inside that very call. */
@@ -75,7 +75,7 @@ class Directory {
   zel_Status findFullEntry(const KarstEntryHeader &header, const ExprMshAllocator &allocator,
                            KarstFullEntry **entry) const;
 
-  /* ---- What reports and the kernel ask. The two waits: not from inside a callback. ---- */
+  /* ---- What reports and the kernel ask. The two waits: not from inside a callback. ----------- */
 
   std::optional<Entry> entry(uint8_t type, const zel_UUID &uuid) const;
   std::vector<Entry> entries(uint8_t type) const; /* in ascending order of UUID */

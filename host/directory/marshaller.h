@@ -20,8 +20,7 @@ zel_Status marshal(const ExprMshField *table, const void *record, std::vector<ui
  * may be of definite or indefinite length. A name that stands twice in a map, where it names a
  * field, makes the record EXPR_MSH_MALFORMED, and so does a name that is not text in one piece;
  * values of names that no row has are passed over as long as they are well-formed CBOR, nested not
- * deeper than
- * 16. ZEL_OK; ZEL_BAD_PARAM as above; EXPR_MSH_... Blocks: no. Under a spinlock: yes. */
+ * deeper than 16. ZEL_OK; ZEL_BAD_PARAM as above; EXPR_MSH_... Blocks: no. Under a spinlock: yes. */
 zel_Status unmarshal(const ExprMshField *table, const void *data, uint32_t length, void *record);
 
 }  // namespace host

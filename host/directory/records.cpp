@@ -160,8 +160,7 @@ zel_Status decode(const std::vector<uint8_t> &data, KarstHealthStatusEntry *reco
 
 }  // namespace host
 
-/* ---- The nested pairs, which readers' tables name ----------------------------------------------
- */
+/* ---- The nested pairs, which readers' tables name -------------------------------------------- */
 
 zel_Status ExprMsh_MshNetInterfaceEntry(ExprMshWriter *writer, const void *field) {
   host::NetworkPart part;

@@ -34,8 +34,7 @@ struct Refusal {
   std::string rule;
 };
 
-/* ---- JSON --------------------------------------------------------------------------------------
- */
+/* ---- JSON ------------------------------------------------------------------------------------ */
 
 /* Refuses a field that is given twice in one object: the parser would keep the last of the two in
  * silence, and the author of the file may mean the first. */
@@ -119,8 +118,7 @@ json parseJSON(const std::string &text, const std::string &fileName) {
   }
 }
 
-/* ---- Values that the schema has passed as text
- * ---------------------------------------------------- */
+/* ---- Values that the schema has passed as text ----------------------------------------------- */
 
 KarstIpAddress readAddress(const json &value, const Path &path) {
   const auto &text = value.get_ref<const std::string &>();
@@ -158,8 +156,7 @@ uint32_t numberOr(const json &object, const char *field, uint32_t absent) {
   return object.contains(field) ? object.at(field).get<uint32_t>() : absent;
 }
 
-/* ---- Rules beyond the schema ------------------------------------------------------------------
- */
+/* ---- Rules beyond the schema ----------------------------------------------------------------- */
 
 class ContentReader {
  public:

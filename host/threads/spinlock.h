@@ -26,8 +26,8 @@ struct Spinlock {
   uint16_t rank = 0;
   std::atomic<uint16_t> hold{0}; /* counts the times that it was taken; written by the holder */
   std::atomic<uint32_t> waiters{0};
-  std::atomic<uint64_t> waitMark{
-      0}; /* a hold (upper 16 bits) and a time (us) by which it had begun */
+  /* A hold (upper 16 bits) and a time (us) by which it had begun. */
+  std::atomic<uint64_t> waitMark{0};
   zel_Name name{};
   zel_HeapID heap = ZEL_NO_HEAP;
   LockDomain *domain = nullptr;

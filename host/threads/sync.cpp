@@ -60,4 +60,9 @@ Thread::~Thread() {
   impl_->thread.join();
 }
 
+const void *Thread::current() {
+  static thread_local char self;
+  return &self;
+}
+
 }  // namespace host

@@ -60,6 +60,9 @@ class Thread {
   Thread(const Thread &) = delete;
   Thread &operator=(const Thread &) = delete;
 
+  /* Stands for the thread that asks, whoever made it, as long as it runs; never null. */
+  static const void *current();
+
  private:
   struct Impl;
   std::unique_ptr<Impl> impl_;

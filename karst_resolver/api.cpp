@@ -70,6 +70,7 @@ EXPORTED zel_Status KARSTResolver_Create(KARSTResolverInstance **result, uint32_
                                               KARST_RESOLVER_RANK_INSTANCE);
   if (status != ZEL_OK) {
     KARST_RESOLVER_REPORT("Failed to create spinlock: %s\n", zel_StatusToString(status));
+    KARSTResolverTagFree(instance->tag, KARST_RESOLVER_TAG_INSTANCE);
     KARSTResolverFree(instance);
     return status;
   }

@@ -25,7 +25,6 @@
 
 enum {
   OK = 0,
-  FAILURE = 0x0bad0001,
   NOT_FOUND = 0x0bad0003,
   BAD_PARAM = 0x0bad0007,
   NO_MEMORY = 0x0bad0014,
@@ -125,6 +124,9 @@ static bool same_uuid(const void *a, const void *b) {
 
 /* ---- the journal: every call of the module, in order; locks show as brackets ----------------- */
 
+/* "c( T11 Wake )c": the cache lock taken, event 11 traced, the world woken, the lock given up. i( is
+ * an instance's lock; a number behind a directory call is the entry type of its query; a refused
+ * allocation is "alloc!", the end of a subscription that does not exist "unsub". */
 static pthread_mutex_t gate;
 static char journal[1 << 16];
 static size_t journal_length;
@@ -187,7 +189,6 @@ static int live_blocks, live_locks, live_subs;
 static void *cache; /* as the module registered it */
 static bool heap_exists, domain_exists, log_open;
 static uint8_t heap_props[52];
-static bool not_an_instance_yet; /* its lock could not be created */
 static bool for_library;         /* the directory allocates, not the module itself */
 static uintptr_t text_begin, text_end;
 
@@ -267,8 +268,8 @@ void zel_HeapFree(uint64_t heap, void *at) {
   CHECK(found != NULL);
   if (found == NULL) give_up("not a block");
   CHECK(all_bytes(found->at + found->size, GUARD, DIRT));
-  if (!not_an_instance_yet) CHECK(memcmp(at, "karstr", 6) != 0);
-  if (found->size == 392 && !not_an_instance_yet)
+  CHECK(memcmp(at, "karstr", 6) != 0);
+  if (found->size == 392)
     CHECK_BYTES(at, "\x94\x9e\x8d\x8c\x8b\x8d\x96\xff", 8);
   if (at == cache) CHECK_BYTES(at, "\x94\x9e\x8d\x8c\x8b\x8d\x9c\xff", 8);
   free(found->at);
@@ -278,7 +279,6 @@ void zel_HeapFree(uint64_t heap, void *at) {
 }
 
 /* ---- lock domain and spinlocks --------------------------------------------------------------- */
- */
 
 static struct lock {
   bool live;
@@ -384,8 +384,7 @@ void zel_SpinlockUnlock(uint64_t lock) {
   if (was_cache && at_cache_unlock_in > 0 && --at_cache_unlock_in == 0) at_cache_unlock();
 }
 
-/* ---- log, text, time, panic
- * ---------------------------------------------------------------------- */
+/* ---- log, text, time, panic ------------------------------------------------------------------ */
 
 static int log_object;
 static struct {
@@ -497,8 +496,7 @@ bool TOLM_IsWitnessNode(void) {
   return host_is_witness;
 }
 
-/* ---- tracing
- * -------------------------------------------------------------------------------------- */
+/* ---- tracing --------------------------------------------------------------------------------- */
 
 enum { SEQUENCE = 0, GLOBAL_BUCKET = 16, THROTTLING = 56, MASK = 72, LAP_SHIFT = 82, FLAGS = 85 };
 enum { NOTIFY = 96, RING = 128, SLOTS = 4096, EVENTS = 19 };
@@ -659,8 +657,7 @@ static uint64_t traced_pointer(unsigned id, int nth_newest) {
   return record != NULL ? number_at(record, 16, 8) : 0;
 }
 
-/* ---- the cache world
- * --------------------------------------------------------------------------------- */
+/* ---- the cache world ------------------------------------------------------------------------- */
 
 static struct {
   bool alive, stopping, woken, has_turn;
@@ -788,8 +785,7 @@ bool tolmapi_PreemptionIsPending(void) {
   return pending;
 }
 
-/* ---- the directory
- * --------------------------------------------------------------------------------------- */
+/* ---- the directory --------------------------------------------------------------------------- */
 
 static struct entry {
   uint8_t type;
@@ -1081,8 +1077,7 @@ void zel_WorldSleep(uint32_t microseconds) {
   }
 }
 
-/* ---- the marshaller: records travel as their own image
- * ------------------------------------------------- */
+/* ---- the marshaller: records travel as their own image --------------------------------------- */
 
 uint32_t ExprMsh_MshNetInterfaceEntry(void) {
   give_up(__func__);
@@ -1167,8 +1162,7 @@ uint32_t ExprMsh_UmshSingleStructure(const void *record_allocator, const void *t
   return status;
 }
 
-/* ---- the module's file
- * ------------------------------------------------------------------------------------ */
+/* ---- the module's file ----------------------------------------------------------------------- */
 
 static uint8_t *image; /* the file */
 static uint8_t *base;  /* the module in memory */

@@ -9,8 +9,7 @@
 
 #include "contract_host.h"
 
-/* ---- scenarios: what they are made of
- * ----------------------------------------------------------------------- */
+/* ---- scenarios: what they are made of -------------------------------------------------------- */
 
 static Uuid uuid_of(unsigned n) {
   Uuid uuid;
@@ -138,8 +137,7 @@ static uint64_t references(const void *instance) {
   return number_at(instance, 8, 8);
 }
 
-/* ---- scenarios: the module's file, load, unload
- * ---------------------------------------------------------------- */
+/* ---- scenarios: the module's file, load, unload ---------------------------------------------- */
 
 static void judge_section(const char *name, const char *content, size_t size) {
   const Elf64_Shdr *found = section(name);
@@ -333,8 +331,7 @@ static void failed_loads_leave_nothing(void) {
   CALLS("");
 }
 
-/* ---- scenarios: enable and disable
- * ------------------------------------------------------------------------------- */
+/* ---- scenarios: enable and disable ----------------------------------------------------------- */
 
 static void failed_enable(uint32_t *refusal, const char *calls, const char *report) {
   *refusal = REFUSED;
@@ -424,9 +421,7 @@ static void disable_empties_the_cache(void) {
   unload();
 }
 
-/* ---- scenarios: nodes
- * ------------------------------------------------------------------------------------------------
- */
+/* ---- scenarios: nodes ------------------------------------------------------------------------ */
 
 #define NODE_TEXT "10001213-1415-1617-1819-1a1b1c1d1e1f"
 static void nodes_follow_their_entries(void) {
@@ -575,8 +570,7 @@ static void pools_are_bounded(void) {
   journal_on = true;
 }
 
-/* ---- scenarios: interfaces
- * ---------------------------------------------------------------------------------------------- */
+/* ---- scenarios: interfaces ------------------------------------------------------------------- */
 
 static void netifs_follow_their_entries(void) {
   begin_enabled("interface entries");
@@ -697,9 +691,7 @@ static void netifs_leave(void) {
   unload();
 }
 
-/* ---- scenarios: locators
- * ----------------------------------------------------------------------------------------------------
- */
+/* ---- scenarios: locators --------------------------------------------------------------------- */
 
 #define SET_SIZE(slots) (52 + (size_t)20 * (slots))
 static uint8_t answer[SET_SIZE(8) + 16];
@@ -887,9 +879,7 @@ static void this_host_is_local(void) {
   unload();
 }
 
-/* ---- scenarios: the cache world
- * ------------------------------------------------------------------------------------------------
- */
+/* ---- scenarios: the cache world -------------------------------------------------------------- */
 
 static void world_works_in_order(void) {
   begin_enabled("the world's order");
@@ -986,9 +976,7 @@ static void world_refreshes_instances(void) {
   unload();
 }
 
-/* ---- scenarios: instances
- * ------------------------------------------------------------------------------------------------------------
- */
+/* ---- scenarios: instances -------------------------------------------------------------------- */
 
 #define NODE_NAME "node:10001213-1415-1617-1819-1a1b1c1d1e1f"
 #define OBJECT_NAME "object:50005253-5455-5657-5859-5a5b5c5d5e5f"
@@ -1085,9 +1073,7 @@ static void creation_can_fail(void) {
   CHECK_EQ(create(&instance, 0, nobody, uuid_of(1), false), NO_MEMORY);
   CALLS("alloc!");
   refuse.lock = REFUSED;
-  not_an_instance_yet = true;
   CHECK_EQ(create(&instance, 0, nobody, uuid_of(1), false), REFUSED);
-  not_an_instance_yet = false;
   CALLS("alloc LockCreate log free");
   LOGGED(2, "KARSTResolver_Create", "Failed to create spinlock: <0bad0777>\n");
   /* A node made for this instance alone goes with it. */
@@ -1116,9 +1102,7 @@ static void creation_can_fail(void) {
   unload();
 }
 
-/* ---- scenarios: objects
- * ----------------------------------------------------------------------------------------------------------------
- */
+/* ---- scenarios: objects ---------------------------------------------------------------------- */
 
 static void *object_instance(unsigned owner, Uuid hint) {
   void *instance = NULL;
@@ -1271,9 +1255,7 @@ static void unload_waits_for_instances(void) {
   nothing_left();
 }
 
-/* ---- scenarios: emission of trace records
- * ----------------------------------------------------------------------------------------------------
- */
+/* ---- scenarios: emission of trace records ---------------------------------------------------- */
 
 static void *emitter;
 /* One SetCallback event (17, class 37, level 2) whose payload ends in `mark`. */
@@ -1450,9 +1432,7 @@ static void phase_is_written_last(void) {
   unload();
 }
 
-/* ---- the last scenario: everything at once
- * -----------------------------------------------------------------------------------------------------
- */
+/* ---- the last scenario: everything at once --------------------------------------------------- */
 
 static bool directory_ends;
 static atomic_uint refreshes;

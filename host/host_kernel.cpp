@@ -16,15 +16,6 @@ namespace {
 
 std::atomic<Kernel *> currentKernel{nullptr};
 
-std::vector<Namespace> providedNamespaces() {
-  return {
-      {"com.tarvik.tracing", "0.0.0.1"},          {"com.tarvik.qxt", "0.0.0.1"},
-      {"com.tarvik.tolmutil", "0.0.0.1"},         {"com.tarvik.karst", "0.0.0.1"},
-      {"com.tarvik.tolmapi", "0.0.0.2"},          {"com.tarvik.zelapi", "v2_4_0_0"},
-      {"com.tarvik.zelapi.incompat", "v2_4_0_0"},
-  };
-}
-
 std::string heapText(zel_HeapID id) {
   const HeapState heap = heapState(id);
   std::string text = formatText("heap %s: %zu blocks alive, %u of %u bytes used", heap.name.c_str(),
@@ -42,7 +33,7 @@ struct Kernel::Impl {
   explicit Impl(const KernelSettings &wanted)
       : settings(wanted),
         directory(wanted.directory),
-        modules(std::make_unique<ModuleLoader>(providedNamespaces(),
+        modules(std::make_unique<ModuleLoader>(platformNamespaces(),
                                                [this] { directory.waitForCallbacks(); })) {}
 
   const KernelSettings settings;

@@ -11,14 +11,6 @@ namespace {
 
 Simulation *onlySimulation = nullptr;
 
-/* What this host serves itself: the same as the real one. */
-std::vector<host::Namespace> providedNamespaces() {
-  return {{"com.tarvik.tracing", "0.0.0.1"},         {"com.tarvik.qxt", "0.0.0.1"},
-          {"com.tarvik.tolmutil", "0.0.0.1"},        {"com.tarvik.karst", "0.0.0.1"},
-          {"com.tarvik.tolmapi", "0.0.0.2"},         {"com.tarvik.zelapi", "v2_4_0_0"},
-          {"com.tarvik.zelapi.incompat", "v2_4_0_0"}};
-}
-
 }  // namespace
 
 Simulation::Simulation(const Settings &settings) : Machine(settings) {
@@ -27,7 +19,7 @@ Simulation::Simulation(const Settings &settings) : Machine(settings) {
   call("host", [&] {
     directory_ = std::make_unique<host::Directory>(host::DirectorySettings{
         .deliveryThreads = settings.deliveryThreads, .queueBound = settings.queueBound});
-    modules_ = std::make_unique<host::ModuleLoader>(providedNamespaces(),
+    modules_ = std::make_unique<host::ModuleLoader>(host::platformNamespaces(),
                                                     [this] { directory_->waitForCallbacks(); });
   });
   keepFibers(true);

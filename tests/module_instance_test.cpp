@@ -358,6 +358,8 @@ TEST_F(Instance, ObjectThatComesBackToItsOwnerIsResolvedAgain) {
   EXPECT_THAT(tracedIds({OBJECT_UPDATED, OBJECT_DISAPPEARED, TRACK_NODE}),
               ElementsAre(OBJECT_DISAPPEARED, TRACK_NODE));
   EXPECT_EQ(client.instance->nodeChanged, 0);
+  const KARSTResolverNodeLocators nothing{};
+  EXPECT_EQ(std::memcmp(&client.instance->locators, &nothing, sizeof nothing), 0);
   putObject(1, 2);
   sim.run();
   EXPECT_THAT(client.states, ElementsAre(RESOLVED, UNRESOLVED, RESOLVED));
@@ -419,6 +421,10 @@ TEST_F(Instance, ObjectInstanceIsFreedByWhoeverComesLast) {
   EXPECT_EQ(instance->destroyed, 1);
   EXPECT_EQ(instance->refCount, 1u);
   EXPECT_EQ(instance->node, nullptr);
+  EXPECT_EQ(instance->callback, nullptr);
+  client.instance = instance;
+  setCallback(client); /* too late: nothing is installed, nobody is called */
+  EXPECT_EQ(instance->callback, nullptr);
   sim.release("karst-delivery");
   sim.run();
   EXPECT_EQ(blocks(), before);

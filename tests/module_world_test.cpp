@@ -209,16 +209,28 @@ TEST_F(World, ObjectThatMovesDuringItsRefreshStaysAway) {
   destroy(client);
 }
 
+TEST_F(World, RefreshForAnotherNodeDoesNothing) {
+  Client client;
+  ASSERT_EQ(createForNode(client, 2), ZEL_OK);
+  setCallback(client);
+  traced();
+  auto *refresh = internal<void(KARSTResolverInstance *, KARSTResolverNode *)>(
+      "KARSTResolverRefreshNodeLocation");
+  sim.call("world", [&] { refresh(client.instance, cachedNode(3)); });
+  EXPECT_EQ(client.states.size(), 1u);
+  EXPECT_THAT(traced(), IsEmpty());
+  destroy(client);
+}
+
 TEST_F(World, StopsWithoutFurtherWork) {
   sim.hold(WORLD);
   putHealth(2, 1);
   sim.run();
-  sim.clearHistory();
   directory().setUsable(false);
   sim.release(WORLD);
   sim.run();
   EXPECT_EQ(cache()->enabled, 0);
-  EXPECT_EQ(sim.call("reader", [&] { return cache()->world; }), ZEL_NO_WORLD);
+  EXPECT_EQ(cache()->world, ZEL_NO_WORLD);
 }
 
 /* Everything at once, in an order that the seed decides: the end is what the directory says. */

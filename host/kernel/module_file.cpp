@@ -144,4 +144,13 @@ void ModuleFile::readAssertions(const ElfImage &image) {
   }
 }
 
+std::vector<Namespace> platformNamespaces() {
+  return {
+      {"com.tarvik.tracing", "0.0.0.1"},          {"com.tarvik.qxt", "0.0.0.1"},
+      {"com.tarvik.tolmutil", "0.0.0.1"},         {"com.tarvik.karst", "0.0.0.1"},
+      {"com.tarvik.tolmapi", "0.0.0.2"},          {"com.tarvik.zelapi", "v2_4_0_0"},
+      {"com.tarvik.zelapi.incompat", "v2_4_0_0"},
+  };
+}
+
 }  // namespace host

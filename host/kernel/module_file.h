@@ -37,6 +37,9 @@ struct Namespace {
 /* "com.tarvik.karst#0.0.0.1" */
 std::string toString(const Namespace &space);
 
+/* The namespaces that stand for platform/: what a host of this project provides itself. */
+std::vector<Namespace> platformNamespaces();
+
 class ModuleFile {
  public:
   /* Throws ModuleError unless the file is a module that is whole, in itself consistent (its tables

@@ -1,12 +1,8 @@
-/* Provides com.example.counter: parameters, an export, an assertion table, a hidden variable. */
+/* Provides com.example.counter: parameters, an export, a hidden variable. */
 #include "tests/modules/test_module.h"
 
 TEST_SECTION(".karst.modinfo")
-static const char info[] =
-    "param_COUNTER_START:int\0"
-    "param_desc_COUNTER_START=Where counting starts\0"
-    "param_COUNTER_FAIL:int\0"
-    "nsProvides=com.example.counter#1.2";
+static const char info[] = "nsProvides=com.example.counter#1.2";
 
 TEST_SECTION(".karst.required")
 static const char required[] = "com.example.host#7";
@@ -25,10 +21,6 @@ static const struct TestParameter parameters[] = {
 TEST_SECTION(".karst.exports")
 static const struct TestExport exports[] = {{"Counter_Next", 0}};
 
-TEST_SECTION(".karst.asserts")
-static const struct TestAssertion assertions[] = {{1, "counter/reset", 77},
-                                                  {1, "counter/wrap", 99}};
-
 TEST_ENTRY int32_t Counter_Next(void) {
   return ++counterStart;
 }
@@ -38,14 +30,9 @@ TEST_ENTRY int32_t Counter_Internal(void) {
   return 0;
 }
 
-__attribute__((noinline)) static void *hereIsInit(void) {
-  return __builtin_return_address(0);
-}
-
 TEST_ENTRY int init_module(void) {
   testRecord("provider init", counterStart);
   testRecord("provider id", zel_ModuleCurrentID);
-  testRecord("provider address", (int64_t)(uintptr_t)hereIsInit());
   return counterFail;
 }
 

@@ -26,10 +26,4 @@ struct TestExport {
   uint64_t reserved;
 };
 
-struct TestAssertion {
-  uint64_t kind;
-  const char *source;
-  uint64_t line;
-};
-
 #endif

@@ -138,7 +138,7 @@ void KARST_Unsubscribe(const KarstQuery *query, KarstSubscriptionFn fn, void *da
 
 zel_Status KARST_FindEntry(const KarstQuery *query, uint32_t next, KarstEntryHeader *header,
                            uint32_t size) {
-  if (size != sizeof *header || next > 1) return ZEL_BAD_PARAM;
+  if (size != sizeof *header) return ZEL_BAD_PARAM;
   return Kernel::current().directory().findEntry(*query, next, header);
 }
 

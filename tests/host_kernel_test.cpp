@@ -228,6 +228,26 @@ TEST(Kernel, SaysWhatThisHostIsAndWhoCalls) {
   expectToKnowTheCaller();
 }
 
+/* The platform's constants are the contract's: any other value is refused, and no block comes. */
+TEST(Kernel, RefusesLookupsThatAreNotAsAgreed) {
+  host::Kernel kernel;
+  const KarstNodeEntry record{};
+  kernel.directory().put({KARST_TYPE_NODE, {{1}}, {{1}}, host::encode(record)});
+  KarstQuery query{};
+  query.type = KARST_TYPE_NODE;
+  query.flags = KARST_QUERY_BY_TYPE | KARST_QUERY_ALL;
+  KarstEntryHeader header{};
+  EXPECT_EQ(KARST_FindEntry(&query, 0, &header, 63), ZEL_BAD_PARAM);
+  ASSERT_EQ(KARST_FindEntry(&query, 0, &header, sizeof header), ZEL_OK);
+  EXPECT_EQ(KARST_FindEntry(&query, 2, &header, sizeof header), ZEL_BAD_PARAM);
+  const ExprMshAllocator allocator{};
+  KarstFullEntry *entry = nullptr;
+  EXPECT_EQ(KARST_FindFullEntryByQuery(&query, 1, &allocator, &entry), ZEL_BAD_PARAM);
+  EXPECT_EQ(KARST_FindFullEntryByHeader(&header, 1, &allocator, 1, &entry), ZEL_BAD_PARAM);
+  EXPECT_EQ(KARST_FindFullEntryByHeader(&header, 0, &allocator, 0, &entry), ZEL_BAD_PARAM);
+  EXPECT_EQ(entry, nullptr);
+}
+
 TEST(Kernel, RunsTheExampleClientAndFollowsChanges) {
   const zel_UUID self = *host::parseUUID("aaaaaaaa-0000-0000-0000-000000000001");
   const zel_UUID link = *host::parseUUID("bbbbbbbb-0000-0000-0000-000000000001");

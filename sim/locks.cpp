@@ -9,6 +9,7 @@
 #include "host/kernel/heap.h"
 #include "host/kernel/log.h"
 #include "host/kernel/panic.h"
+#include "sim/observer.h"
 #include "sim/platform_call.h"
 
 namespace sim {
@@ -172,6 +173,7 @@ extern "C" void zel_SpinlockLock(zel_SpinlockHandle handle) {
   }
   lock.holder = &fiber;
   fiber.held[fiber.heldCount++] = &lock;
+  if (Observer *observer = call.machine().observer()) observer->locked(fiber, lock);
 }
 
 extern "C" void zel_SpinlockUnlock(zel_SpinlockHandle handle) {
@@ -182,6 +184,7 @@ extern "C" void zel_SpinlockUnlock(zel_SpinlockHandle handle) {
     host::panic("spinlock \"%s\" is unlocked by %s %s%s", lock.name.text, fiber.name().c_str(),
                 lock.holder ? "but held by " : "while nobody holds it",
                 lock.holder ? lock.holder->name().c_str() : "");
+  if (Observer *observer = call.machine().observer()) observer->unlocking(fiber, lock);
   lock.holder = nullptr;
   forget(fiber, lock);
   call.machine().scheduler().wakeAll(lock.waiters);

@@ -19,6 +19,7 @@
 #include <vector>
 
 #include "host/tracing/tracing.h"
+#include "sim/callbacks.h"
 #include "sim/calls.h"
 #include "sim/history.h"
 #include "sim/locks.h"
@@ -26,6 +27,8 @@
 #include "sim/worlds.h"
 
 namespace sim {
+
+class Observer;
 
 enum class Switching {
   WhenBlocked, /* a fiber runs until it cannot go on */
@@ -130,6 +133,9 @@ class Machine {
    * always gets a no, which does not count. */
   void forcePreemption(uint64_t times) { forcedPreemptions_ = times; }
 
+  /* Is told of everything from now on, until another one or null takes its place. */
+  void setObserver(Observer *observer) { observer_ = observer; }
+
   /* ---- What happened. ------------------------------------------------------------------------ */
 
   std::vector<HistoryEntry> history() const { return history_.entries(); }
@@ -150,6 +156,8 @@ class Machine {
   Scheduler &scheduler() { return scheduler_; }
   LockTable &locks() { return locks_; }
   WorldTable &worlds() { return worlds_; }
+  CallbackTable &callbacks() { return callbacks_; }
+  Observer *observer() { return observer_; }
   bool answersPreemption(); /* what a question that may be answered with yes gets */
 
  protected:
@@ -178,6 +186,8 @@ class Machine {
   History history_;
   LockTable locks_;
   WorldTable worlds_;
+  CallbackTable callbacks_;
+  Observer *observer_ = nullptr;
   std::vector<Faults> faults_{callCount};
   uint64_t faultsInjected_ = 0;
   uint32_t lastOwnFiber_ = 0; /* the fibers with ids up to this are the host's own */

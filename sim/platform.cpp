@@ -14,6 +14,7 @@
 #include "platform/karst_directory.h"
 #include "platform/qxt.h"
 #include "platform/tolm.h"
+#include "sim/observer.h"
 #include "sim/platform_call.h"
 #include "sim/simulation.h"
 
@@ -27,6 +28,14 @@ host::Directory &directory() {
 
 Argument subjectOf(const KarstQuery &query) {
   return Argument::entry(query.type, query.uuid);
+}
+
+zel_UUID wantedBy(const KarstQuery &query) {
+  return query.flags & KARST_QUERY_ALL ? zel_UUID{} : query.uuid;
+}
+
+void report(PlatformCall &call, const Lookup &lookup) {
+  if (Observer *observer = call.machine().observer()) observer->lookedUp(call.fiber(), lookup);
 }
 
 }  // namespace
@@ -155,50 +164,68 @@ extern "C" bool TOLM_IsWitnessNode(void) {
 extern "C" zel_Status KARST_RegisterStatusCallback(KarstStatusFn fn, void *data) {
   PlatformCall call(Call::KARST_RegisterStatusCallback);
   if (call.fault()) return call.fault();
-  return call.returns(directory().registerStatus(fn, data));
+  return call.returns(call.machine().callbacks().registerStatus(directory(), fn, data));
 }
 
 extern "C" void KARST_DeregisterStatusCallback(KarstStatusFn fn, void *data) {
   PlatformCall call(Call::KARST_DeregisterStatusCallback);
-  directory().deregisterStatus(fn, data);
+  call.machine().callbacks().deregisterStatus(directory(), fn, data);
 }
 
 extern "C" void KARST_GetSelfUUID(zel_UUID *uuid) {
   PlatformCall call(Call::KARST_GetSelfUUID);
   *uuid = directory().self();
+  if (Observer *observer = call.machine().observer()) observer->toldSelf(call.fiber(), *uuid);
 }
 
 extern "C" zel_Status KARST_Subscribe(const KarstQuery *query, KarstSubscriptionFn fn, void *data) {
   PlatformCall call(Call::KARST_Subscribe, subjectOf(*query));
-  if (call.fault()) return call.fault();
-  return call.returns(directory().subscribe(query, fn, data));
+  zel_Status status = call.fault();
+  if (status == ZEL_OK)
+    status = call.returns(call.machine().callbacks().subscribe(directory(), query, fn, data));
+  if (Observer *observer = call.machine().observer())
+    observer->subscribed(call.fiber(), *query, data, status);
+  return status;
 }
 
 extern "C" void KARST_Unsubscribe(const KarstQuery *query, KarstSubscriptionFn fn, void *data) {
   PlatformCall call(Call::KARST_Unsubscribe, subjectOf(*query));
-  directory().unsubscribe(query, fn, data);
+  if (Observer *observer = call.machine().observer())
+    observer->unsubscribing(call.fiber(), *query, data);
+  call.machine().callbacks().unsubscribe(directory(), query, fn, data);
 }
 
 extern "C" zel_Status KARST_FindEntry(const KarstQuery *query, uint32_t next,
                                       KarstEntryHeader *header, uint32_t size) {
   PlatformCall call(Call::KARST_FindEntry, subjectOf(*query));
-  if (call.fault()) return call.fault();
-  if (size != sizeof *header) return call.returns(ZEL_BAD_PARAM);
-  return call.returns(directory().findEntry(*query, next, header));
+  zel_Status status = call.fault();
+  if (status == ZEL_OK)
+    status = call.returns(size == sizeof *header ? directory().findEntry(*query, next, header)
+                                                 : ZEL_BAD_PARAM);
+  report(call, {Call::KARST_FindEntry, query->type, wantedBy(*query), next, status,
+                status == ZEL_OK ? header : nullptr});
+  return status;
 }
 
 extern "C" zel_Status KARST_FindFullEntryByQuery(const KarstQuery *query, uint32_t,
                                                  const ExprMshAllocator *allocator,
                                                  KarstFullEntry **entry) {
   PlatformCall call(Call::KARST_FindFullEntryByQuery, subjectOf(*query));
-  if (call.fault()) return call.fault();
-  return call.returns(directory().findFullEntry(*query, *allocator, entry));
+  zel_Status status = call.fault();
+  if (status == ZEL_OK) status = call.returns(directory().findFullEntry(*query, *allocator, entry));
+  report(call, {Call::KARST_FindFullEntryByQuery, query->type, wantedBy(*query), 0, status,
+                status == ZEL_OK ? &(*entry)->header : nullptr});
+  return status;
 }
 
 extern "C" zel_Status KARST_FindFullEntryByHeader(const KarstEntryHeader *header, uint32_t,
                                                   const ExprMshAllocator *allocator, uint32_t,
                                                   KarstFullEntry **entry) {
   PlatformCall call(Call::KARST_FindFullEntryByHeader, Argument::entry(0, header->uuid));
-  if (call.fault()) return call.fault();
-  return call.returns(directory().findFullEntry(*header, *allocator, entry));
+  zel_Status status = call.fault();
+  if (status == ZEL_OK)
+    status = call.returns(directory().findFullEntry(*header, *allocator, entry));
+  report(call, {Call::KARST_FindFullEntryByHeader, 0, header->uuid, 0, status,
+                status == ZEL_OK ? &(*entry)->header : nullptr});
+  return status;
 }

@@ -13,6 +13,7 @@
 #include "host/kernel/text.h"
 #include "host/threads/worlds.h"
 #include "platform/tolm.h"
+#include "sim/observer.h"
 #include "sim/platform_call.h"
 
 namespace sim {
@@ -101,9 +102,14 @@ extern "C" zel_Status TOLM_WorldCreate(zel_WorldID *world, const char *name, zel
                                        uint32_t (*body)(void *data), void *data, uint32_t,
                                        zel_HeapID heap) {
   PlatformCall call(Call::TOLM_WorldCreate, Argument::text(name));
-  if (call.fault()) return call.fault();
-  void *memory = host::heapAlloc(heap, sizeof(World), __builtin_return_address(0));
-  if (!memory) return call.returns(ZEL_NO_MEMORY);
+  zel_Status status = call.fault();
+  void *memory = nullptr;
+  if (status == ZEL_OK) {
+    memory = host::heapAlloc(heap, sizeof(World), __builtin_return_address(0));
+    status = call.returns(memory ? ZEL_OK : ZEL_NO_MEMORY);
+  }
+  if (Observer *observer = call.machine().observer()) observer->worldCreated(call.fiber(), status);
+  if (status != ZEL_OK) return status;
   auto *created = new (memory) World;
   created->heap = heap;
   host::fillName(&created->name, name);
@@ -114,7 +120,7 @@ extern "C" zel_Status TOLM_WorldCreate(zel_WorldID *world, const char *name, zel
   Fiber &fiber = call.machine().scheduler().spawn(
       created->name.text, [body, data] { body(data); }, [created] { endWorld(*created); });
   fiber.world = created;
-  return call.returns(ZEL_OK);
+  return ZEL_OK;
 }
 
 extern "C" void TOLM_WorldDestroy(zel_WorldID *world) {
@@ -130,6 +136,7 @@ extern "C" void TOLM_WorldDestroy(zel_WorldID *world) {
   const zel_HeapID heap = ending.heap;
   ending.~World();
   host::heapFree(heap, &ending);
+  if (Observer *observer = machine.observer()) observer->worldEnded(call.fiber());
 }
 
 extern "C" zel_Status zel_WorldWait(uint64_t event, zel_SpinlockHandle lock, uint32_t timeout,
@@ -152,7 +159,9 @@ extern "C" zel_Status zel_WorldWait(uint64_t event, zel_SpinlockHandle lock, uin
   world->reason = nullptr;
   world->woken = false;
   noteChange(machine);
-  return call.returns(world->stopping ? ZEL_WORLD_STOPPING : ZEL_OK);
+  const zel_Status status = world->stopping ? ZEL_WORLD_STOPPING : ZEL_OK;
+  if (Observer *observer = machine.observer()) observer->worldWaited(call.fiber(), status);
+  return call.returns(status);
 }
 
 extern "C" void zel_WorldForceWakeup(zel_WorldID id) {
@@ -188,6 +197,8 @@ extern "C" bool tolmapi_PreemptionIsPending(void) {
   World *world = call.fiber().world;
   if (!world) return call.returns(false);
   world->preemptionAnswered = !world->preemptionAnswered && call.machine().answersPreemption();
+  if (Observer *observer = call.machine().observer())
+    observer->preemptionAnswered(call.fiber(), world->preemptionAnswered);
   return call.returns(world->preemptionAnswered);
 }
 

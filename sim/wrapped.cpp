@@ -5,6 +5,7 @@
  */
 #include "platform/expr_msh.h"
 #include "platform/tracing.h"
+#include "sim/observer.h"
 #include "sim/platform_call.h"
 
 using namespace sim;
@@ -26,9 +27,13 @@ zel_Status ExprMsh_UmshSingleStructure(const ExprMshAllocator *allocator, const 
                                        const void *data, uint32_t length, const char *name,
                                        void *record) {
   PlatformCall call(Call::ExprMsh_UmshSingleStructure, Argument::text(name));
-  if (call.fault()) return call.fault();
-  return call.returns(
-      host_ExprMsh_UmshSingleStructure(allocator, table, data, length, name, record));
+  zel_Status status = call.fault();
+  if (status == ZEL_OK)
+    status = call.returns(
+        host_ExprMsh_UmshSingleStructure(allocator, table, data, length, name, record));
+  if (Observer *observer = call.machine().observer())
+    observer->decoded(call.fiber(), name, status, record);
+  return status;
 }
 
 int32_t Trace_ClassLevelGet(uint32_t traceClass) {

@@ -1,0 +1,102 @@
+/* Records of subscriptions and registrations, and the functions that the directory calls in their
+ * place. One OS thread, no lock.
+ */
+#include "sim/callbacks.h"
+
+#include <algorithm>
+
+#include "host/kernel/panic.h"
+#include "sim/machine.h"
+#include "sim/observer.h"
+
+namespace sim {
+
+struct CallbackTable::Subscription {
+  CallbackTable *table;
+  const KarstQuery *query;
+  KarstSubscriptionFn fn;
+  void *data;
+  uint8_t type;
+  bool cancelled = false; /* only the last call is left */
+};
+
+struct CallbackTable::Registration {
+  KarstStatusFn fn;
+  void *data;
+};
+
+CallbackTable::CallbackTable() = default;
+CallbackTable::~CallbackTable() = default;
+
+/* ---- Subscriptions --------------------------------------------------------------------------- */
+
+zel_Status CallbackTable::subscribe(host::Directory &directory, const KarstQuery *query,
+                                    KarstSubscriptionFn fn, void *data) {
+  if (!query || !fn) return ZEL_BAD_PARAM;
+  subscriptions_.push_back({this, query, fn, data, query->type});
+  const zel_Status status = directory.subscribe(query, &callSubscriber, &subscriptions_.back());
+  if (status != ZEL_OK) subscriptions_.pop_back();
+  return status;
+}
+
+void CallbackTable::unsubscribe(host::Directory &directory, const KarstQuery *query,
+                                KarstSubscriptionFn fn, void *data) {
+  const auto found =
+      std::find_if(subscriptions_.begin(), subscriptions_.end(), [=](const Subscription &one) {
+        return !one.cancelled && one.query == query && one.fn == fn && one.data == data;
+      });
+  if (found == subscriptions_.end()) return;
+  found->cancelled = true;
+  directory.unsubscribe(query, &callSubscriber, &*found);
+}
+
+zel_Status CallbackTable::callSubscriber(void *record, const KarstEntryHeader *header,
+                                         void *argument, zel_Status status) {
+  auto &subscription = *static_cast<Subscription *>(record);
+  Machine &machine = Machine::current();
+  Fiber &fiber = machine.scheduler().running();
+  const SubscriptionCall call{subscription.fn, subscription.data, subscription.type, header,
+                              status};
+  if (Observer *observer = machine.observer()) observer->subscriptionCalls(fiber, call);
+  const zel_Status result = call.fn(call.data, header, argument, status);
+  requireNoSpinlock(fiber, "returns from a subscription's callback");
+  if (Observer *observer = machine.observer()) observer->subscriptionReturned(fiber, call);
+  if (status == ZEL_SUB_CANCELLED) {
+    subscription.table->subscriptions_.remove_if(
+        [&](const Subscription &one) { return &one == &subscription; });
+  }
+  return result;
+}
+
+/* ---- Status ---------------------------------------------------------------------------------- */
+
+zel_Status CallbackTable::registerStatus(host::Directory &directory, KarstStatusFn fn, void *data) {
+  if (!fn) return ZEL_BAD_PARAM;
+  registrations_.push_back({fn, data});
+  const zel_Status status = directory.registerStatus(&callStatus, &registrations_.back());
+  if (status != ZEL_OK) registrations_.pop_back();
+  return status;
+}
+
+void CallbackTable::deregisterStatus(host::Directory &directory, KarstStatusFn fn, void *data) {
+  for (auto it = registrations_.begin(); it != registrations_.end();) {
+    if (it->fn == fn && it->data == data) {
+      directory.deregisterStatus(&callStatus, &*it);
+      it = registrations_.erase(it);
+    } else {
+      ++it;
+    }
+  }
+}
+
+void CallbackTable::callStatus(void *record, uint32_t status) {
+  const Registration registration = *static_cast<Registration *>(record);
+  Machine &machine = Machine::current();
+  Fiber &fiber = machine.scheduler().running();
+  if (Observer *observer = machine.observer()) observer->statusCalls(fiber, status);
+  registration.fn(registration.data, status);
+  requireNoSpinlock(fiber, "returns from a status callback");
+  if (Observer *observer = machine.observer()) observer->statusReturned(fiber, status);
+}
+
+}  // namespace sim

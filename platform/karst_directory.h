@@ -132,6 +132,15 @@ ZEL_STATIC_ASSERT(offsetof(KarstHealthStatusEntry, healthReason) == 16, "health 
  * unusable alternate. A directory that is usable already says so to a new registration. */
 typedef void (*KarstStatusFn)(void *data, uint32_t status);
 
+/* An interruption lasts from the moment at which a usable directory becomes unusable until it is
+ * usable again, every status call has returned, and so has every other call that ran then. Whoever
+ * follows the directory only while it is usable misses what happens meanwhile, and learns it so:
+ *
+ * - A subscription to all entries of a type that starts during an interruption is told first of each
+ *   entry that is gone, if not every subscriber had been told so when the interruption began:
+ *   ZEL_OK, then ZEL_NOT_FOUND. Lookups do not find it.
+ * - At the end of the interruption every subscription is told ZEL_SUB_RESYNC. */
+
 /* ZEL_OK or ZEL_NO_MEMORY. Calls may come before this returns. Blocks: yes. Under a spinlock: no.
  */
 zel_Status KARST_RegisterStatusCallback(KarstStatusFn fn, void *data);
@@ -147,12 +156,14 @@ void KARST_GetSelfUUID(zel_UUID *uuid);
 
 /* A subscriber's callback, called on the directory's own threads, never from inside KARST_Subscribe
  * or KARST_Unsubscribe. Calls of one subscription never overlap and come in the order of the
- * changes: first ZEL_OK for each entry that matches already, then every change.
+ * changes: first ZEL_OK for each entry that matches already (during an interruption there is more,
+ * see above), or ZEL_NOT_FOUND where one entry was asked for and is not there, then every change. So
+ * what was looked up before the subscription began is not stale for longer than until then.
  *
  *   ZEL_OK             the entry of `header` was added or changed
  *   ZEL_NOT_FOUND      the entry of `header` was removed, or left the owner that `header` names
  *   ZEL_SUB_OVERFLOW   changes were lost: what the directory holds from now on was not told
- *   ZEL_SUB_RESYNC     likewise, after the directory itself has started over
+ *   ZEL_SUB_RESYNC     likewise, after the directory itself has started over, or an interruption
  *   ZEL_SUB_CANCELLED  the last call of a subscription that was cancelled
  *
  * `header` is meaningful with the first two. `argument` has no meaning. The result is ignored. */

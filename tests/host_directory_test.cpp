@@ -204,7 +204,7 @@ TEST_F(DirectoryTest, TellsWhatIsThereThenEveryChangeInOrderAndInTurn) {
   directory.waitUntilIdle();
   EXPECT_THAT(a.events, ElementsAre("+10", "+20", "+30", "+5", "-20", "+7"));
   EXPECT_EQ(b.events, a.events);
-  EXPECT_THAT(single.events, ElementsAre("+7", "-7", "+7/2", "-7/2"));
+  EXPECT_THAT(single.events, ElementsAre("-7/0", "+7", "-7", "+7/2", "-7/2")) << "first: not there";
   EXPECT_EQ(turns, "abababababab");
 }
 
@@ -312,6 +312,73 @@ TEST_F(DirectoryTest, UsableAndUnusableAlternate) {
   turn(false);
   EXPECT_THAT(early.events, ElementsAre("usable", "unusable", "usable")) << "one interruption";
   EXPECT_THAT(late.events, ElementsAre("usable", "unusable", "usable", "unusable"));
+}
+
+/* A reader that follows the nodes only while it is told that the directory is usable. */
+class DirectoryInterruption : public DirectoryTest {
+ protected:
+  void SetUp() override {
+    status.act = [&](const std::string &event, const KarstEntryHeader &) {
+      event == "usable" ? reader.subscribe() : reader.unsubscribe();
+    };
+    status.startStatus();
+  }
+
+  Listener status{directory, {}}, reader{directory, every(node)}, other{directory, every(node)};
+};
+
+TEST_F(DirectoryInterruption, EndsInWhatWasMissedAndAResync) {
+  putNodes({1, 2, 3, 4});
+  Listener later{directory, {}}, single{directory, one(node, 2)};
+  later.act = [&](const std::string &, const KarstEntryHeader &) {
+    EXPECT_THAT(other.events, testing::Not(testing::Contains("resync"))) << "not all know yet";
+    if (later.events.size() == 3) directory.remove(node, uuid(4));
+  };
+  later.startStatus();
+  other.subscribe();
+  directory.remove(node, uuid(1)); /* there is nothing to interrupt yet */
+  turn(true);
+  EXPECT_THAT(reader.events, ElementsAre("+2", "+3", "+4"));
+  turn(false);
+  for (const uint8_t number : {2, 3}) directory.remove(node, uuid(number));
+  putNodes({3}); /* back again */
+  single.subscribe();
+  directory.waitUntilIdle();
+  reader.events.clear();
+  turn(true);
+  EXPECT_THAT(reader.events, ElementsAre("+2", "-2", "+3", "+4", "resync"));
+  EXPECT_THAT(single.events, ElementsAre("-2/0", "resync")) << "its owner of the past is not told";
+  EXPECT_THAT(other.events, ElementsAre("+1", "+2", "+3", "+4", "-1", "-2", "-3", "+3", "resync"));
+  later.endStatus();
+  reader.events.clear();
+  for (const bool isUsable : {false, true}) turn(isUsable);
+  EXPECT_THAT(reader.events, ElementsAre("cancelled", "+3", "resync")) << "all was told before";
+  status.endStatus();
+  for (const bool isUsable : {false, true}) turn(isUsable);
+  EXPECT_EQ(reader.events.back(), "resync") << "nobody had to be told first";
+  EXPECT_EQ(reader.events.size(), 4u);
+}
+
+TEST_F(DirectoryInterruption, KeepsWhatAnInterruptionDropped) {
+  putNodes({1, 2, 3});
+  other.act = [&](const std::string &event, const KarstEntryHeader &) {
+    if (event == "resync" && other.events.size() == 6) directory.setUsable(false);
+  };
+  other.subscribe();
+  directory.waitUntilIdle();
+  reader.holding = true;
+  directory.setUsable(true);
+  reader.reached.wait(); /* in its first call */
+  for (const uint8_t number : {2, 3}) directory.remove(node, uuid(number));
+  directory.setUsable(false);
+  reader.release();
+  directory.waitUntilIdle();
+  EXPECT_THAT(reader.events, ElementsAre("+1", "cancelled")) << "before it was told the removals";
+  turn(true); /* unusable again as soon as that is known, and before the reader was told all */
+  EXPECT_THAT(reader.events, testing::Not(testing::Contains("-3")));
+  reader.events.clear();
+  turn(true);
+  EXPECT_THAT(reader.events, ElementsAre("+2", "-2", "+3", "-3", "+1", "resync"));
 }
 
 TEST(DirectoryStatus, LongCallHoldsUpItsDeregistrationAndNoSubscription) {

@@ -1,5 +1,7 @@
 /* The cache: enable and disable, nodes and interfaces from their entries, faults in records,
  * rescans, capacity, and the locators that come of it. */
+#include <random>
+
 #include "tests/module_fixture.h"
 
 using sim::Call;
@@ -107,6 +109,33 @@ TEST_F(Cache, NodesThatInstancesHoldOutliveADisable) {
   destroy(client);
 }
 
+TEST_F(Cache, InstancesLearnWhatADisableMissed) {
+  for (uint32_t n : {1, 2}) putSimpleNode(n);
+  putObject(1, 1);
+  start();
+  Client node, object;
+  ASSERT_EQ(createForNode(node, 2), ZEL_OK);
+  ASSERT_EQ(createForObject(object, 1), ZEL_OK);
+  for (Client *client : {&node, &object}) setCallback(*client);
+  directory().setUsable(false);
+  sim.run();
+  directory().remove(KARST_TYPE_NODE, nodeUUID(2));
+  directory().remove(KARST_TYPE_NET_INTERFACE, netIfUUID(2));
+  directory().remove(objectType, objectUUID(1));
+  sim.run();
+  putObject(1, 1);
+  sim.run();
+  EXPECT_THAT(addresses(node), ElementsAre("10.0.0.2")) << "nobody refreshes it";
+  EXPECT_THAT(addresses(object), IsEmpty()) << "it found no node to attach to";
+  directory().setUsable(true);
+  sim.run();
+  EXPECT_THAT(addresses(node), IsEmpty());
+  EXPECT_THAT(addresses(object), ElementsAre("10.0.0.1"));
+  EXPECT_EQ(node.states.back(), KARST_RESOLVER_STATE_UNRESOLVED);
+  EXPECT_EQ(object.states.back(), KARST_RESOLVER_STATE_RESOLVED);
+  for (Client *client : {&node, &object}) destroy(*client);
+}
+
 TEST_F(Cache, DirtyNodesWaitForTheNextWorld) {
   putSimpleNode(1);
   start();
@@ -180,6 +209,81 @@ TEST_F(Cache, UnloadWaitsForLastCallsAndInstances) {
   sim.release("karst-delivery");
   sim.finish(unloading);
 }
+
+/* Entries that come and go around interruptions of any length, in an order that the seed decides,
+ * with now one delivery thread held back, now the other: when all is quiet, every answer is the
+ * directory's. */
+class Interruptions : public Cache, public ::testing::WithParamInterface<uint64_t> {
+ protected:
+  Interruptions() : Cache(settings()) {}
+  static sim::Settings settings() {
+    sim::Settings settings = defaults();
+    settings.seed = GetParam();
+    settings.queueBound = 4;
+    return settings;
+  }
+  void putOrRemove(const host::Entry &entry) {
+    directory().entry(entry.type, entry.uuid) ? directory().remove(entry.type, entry.uuid)
+                                              : directory().put(entry);
+  }
+};
+
+TEST_P(Interruptions, LeaveNoStaleAnswer) {
+  constexpr uint32_t count = 3;
+  std::vector<host::Entry> nodes, netIfs, objects;
+  for (uint32_t n = 1; n <= count; n++) {
+    putSimpleNode(n);
+    putObject(n, n);
+    nodes.push_back(*directory().entry(KARST_TYPE_NODE, nodeUUID(n)));
+    netIfs.push_back(*directory().entry(KARST_TYPE_NET_INTERFACE, netIfUUID(n)));
+    objects.push_back(*directory().entry(objectType, objectUUID(n)));
+  }
+  start();
+  std::vector<Client> ofNodes(count), ofObjects(count);
+  for (uint32_t n = 1; n <= count; n++) {
+    ASSERT_EQ(createForNode(ofNodes[n - 1], n), ZEL_OK);
+    ASSERT_EQ(createForObject(ofObjects[n - 1], n), ZEL_OK);
+  }
+  sim.run();
+  sim.setSwitching(sim::Switching::Random);
+  sim.finish(sim.spawn("source", [&] {
+    std::minstd_rand random(static_cast<uint32_t>(GetParam()));
+    for (int i = 0; i < 60; i++) {
+      const uint32_t what = random() % 4, n = random() % count;
+      if (what == 0) directory().setUsable(random() % 2 == 0);
+      if (what == 1) {
+        putOrRemove(nodes[n]);
+        putOrRemove(netIfs[n]);
+      }
+      if (what == 2) putOrRemove(objects[n]);
+      if (what == 3) {
+        sim.releaseAll();
+        if (random() % 2 == 0) {
+          sim.hold("karst-delivery-" + std::to_string(random() % 2));
+        } else {
+          directory().waitUntilIdle();
+        }
+      }
+    }
+    directory().setUsable(true);
+  }));
+  sim.run(); /* the one that is held back comes late */
+  sim.releaseAll();
+  sim.run();
+  for (uint32_t n = 1; n <= count; n++) {
+    const bool nodeIsThere = directory().entry(KARST_TYPE_NODE, nodeUUID(n)).has_value();
+    const bool objectIsThere = directory().entry(objectType, objectUUID(n)).has_value();
+    std::vector<std::string> expected = {"10.0.0." + std::to_string(n)};
+    if (!nodeIsThere) expected.clear();
+    EXPECT_EQ(addresses(ofNodes[n - 1]), expected) << "node " << n;
+    if (!objectIsThere) expected.clear();
+    EXPECT_EQ(addresses(ofObjects[n - 1]), expected) << "object " << n;
+    destroy(ofNodes[n - 1]);
+    destroy(ofObjects[n - 1]);
+  }
+}
+
+INSTANTIATE_TEST_SUITE_P(Seeds, Interruptions, ::testing::Range<uint64_t>(1, 60));
 
 /* ---- Nodes ----------------------------------------------------------------------------------- */
 

@@ -6,11 +6,12 @@
 #include <algorithm>
 #include <limits>
 #include <string>
+#include <utility>
 
 namespace host {
 
-Delivery::Delivery(Mutex &mutex, unsigned threads)
-    : mutex_(mutex), running_(std::max(threads, 1u), 0) {
+Delivery::Delivery(Mutex &mutex, unsigned threads, std::function<void()> onReturn)
+    : mutex_(mutex), onReturn_(std::move(onReturn)), running_(std::max(threads, 1u), 0) {
   for (size_t i = 0; i < running_.size(); ++i) {
     threads_.push_back(
         std::make_unique<Thread>("karst-delivery-" + std::to_string(i), [this, i] { work(i); }));
@@ -50,6 +51,7 @@ void Delivery::work(size_t worker) {
       recipient->caller_ = nullptr;
       running_[worker] = 0;
       schedule(recipient);
+      onReturn_();
     }
     returned_.notifyAll();
   }
@@ -60,8 +62,12 @@ bool Delivery::anyRunning(uint64_t lastCall) const {
                      [=](uint64_t call) { return call != 0 && call <= lastCall; });
 }
 
+bool Delivery::idle() const {
+  return ready_.empty() && !anyRunning(std::numeric_limits<uint64_t>::max());
+}
+
 void Delivery::waitUntilIdle(std::unique_lock<Mutex> &lock) {
-  while (!ready_.empty() || anyRunning(std::numeric_limits<uint64_t>::max())) {
+  while (!idle()) {
     returned_.wait(lock, {"until the directory has nothing to deliver", false});
   }
 }

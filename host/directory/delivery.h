@@ -5,6 +5,7 @@
 
 #include <cstdint>
 #include <deque>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <vector>
@@ -39,7 +40,8 @@ class Recipient {
  * call of it and puts it back at the end, so that none can starve the others. */
 class Delivery {
  public:
-  Delivery(Mutex &mutex, unsigned threads); /* at least one thread is started */
+  /* Starts at least one thread. `onReturn` is called with the lock held after each call. */
+  Delivery(Mutex &mutex, unsigned threads, std::function<void()> onReturn);
   ~Delivery() { end(); }
   Delivery(const Delivery &) = delete;
   Delivery &operator=(const Delivery &) = delete;
@@ -53,6 +55,8 @@ class Delivery {
   /* Notes that the recipient has something due; harmless when it has not. Never blocks. */
   void schedule(const std::shared_ptr<Recipient> &recipient);
 
+  bool idle() const; /* nothing is due and no call runs */
+
   /* These give the lock up while they wait. The first two must not be called from a callback. */
   void waitUntilIdle(std::unique_lock<Mutex> &lock);
   void waitForCallbacks(std::unique_lock<Mutex> &lock);
@@ -60,12 +64,13 @@ class Delivery {
   void waitUntilReturned(const Recipient &recipient, std::unique_lock<Mutex> &lock);
 
   uint64_t calls() const { return calls_; }
+  bool anyRunning(uint64_t lastCall) const; /* of the calls up to that one */
 
  private:
   void work(size_t worker);
-  bool anyRunning(uint64_t lastCall) const; /* of the calls up to that one */
 
   Mutex &mutex_;
+  const std::function<void()> onReturn_;
   Condition due_;      /* the ready list has grown, or the end has come */
   Condition returned_; /* a call has returned */
   std::deque<std::shared_ptr<Recipient>> ready_;

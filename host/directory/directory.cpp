@@ -99,7 +99,8 @@ zel_Status copyWhole(const SharedEntry &entry, const ExprMshAllocator &allocator
 
 struct Directory::Impl {
   explicit Impl(const DirectorySettings &settings)
-      : queueBound(settings.queueBound), delivery(mutex, settings.deliveryThreads) {}
+      : queueBound(settings.queueBound),
+        delivery(mutex, settings.deliveryThreads, [this] { settle(); }) {}
 
   /* An entry to be read without the lock, which these two take; null when there is none. */
   SharedEntry firstOf(const Key &wanted); /* what a query asks for */
@@ -109,6 +110,9 @@ struct Directory::Impl {
   void tell(const std::shared_ptr<Subscription> &subscription, const KarstEntryHeader &header,
             zel_Status status);
   void tellMatching(const Entry &entry, zel_Status status);
+  void tellMissed(Subscription &subscription, const Key &key) const;
+  void tellResync();
+  void settle();
 
   const size_t queueBound;
   Mutex mutex;
@@ -116,6 +120,9 @@ struct Directory::Impl {
   Entries entries;
   zel_UUID self{};
   bool usable = false;
+  bool interrupted = false; /* from unusable after usable to the end that settle() finds */
+  std::optional<uint64_t> lastBefore; /* while usable again: the last call that may be an old one */
+  Entries missed; /* removed since all had last been told everything, and not back */
   std::multimap<Key, std::shared_ptr<Subscription>> installed; /* by what they ask for */
   size_t subscriptionsAlive = 0;
   uint64_t overflows = 0;
@@ -151,11 +158,50 @@ void Directory::Impl::tellMatching(const Entry &entry, zel_Status status) {
   if (!isZero(entry.uuid)) tellAll({entry.type, entry.uuid});
 }
 
+/* A reader that follows a type only while the directory is usable may still go by entries of which
+ * it was not told that they have gone. It is told when it starts to follow the type again. */
+void Directory::Impl::tellMissed(Subscription &subscription, const Key &key) const {
+  /* Who follows one entry looks it up, and is not to be misled by an owner of the past. */
+  if (!interrupted || !isZero(key.uuid)) return;
+  for (auto it = firstMatch(missed, key); it != missed.end();
+       it = nextMatch(missed, key, it->first)) {
+    const KarstEntryHeader header = headerOf(*it->second);
+    subscription.tellAtStart(header, ZEL_OK);
+    subscription.tellAtStart(header, ZEL_NOT_FOUND);
+  }
+}
+
+void Directory::Impl::tellResync() {
+  for (const auto &[key, subscription] : installed) {
+    subscription->tellResync();
+    delivery.schedule(subscription);
+  }
+}
+
+/* Ends an interruption as soon as every status call has returned: readers that had no use for what
+ * they were told meanwhile have one now, and read it again. Calls that still run are waited for,
+ * since one of a subscription that is cancelled by now may act late on what has changed since. What
+ * was missed is kept until it was told: the next interruption may drop calls that are still due. */
+void Directory::Impl::settle() {
+  if (!usable) return;
+  for (const auto &registration : registrations) {
+    if (registration->due() || registration->running()) return;
+  }
+  if (interrupted) {
+    if (!lastBefore) lastBefore = delivery.calls();
+    if (delivery.anyRunning(*lastBefore)) return;
+    interrupted = false;
+    tellResync();
+  }
+  if (delivery.idle()) missed.clear();
+}
+
 Directory::Directory(const DirectorySettings &settings) : impl_(std::make_unique<Impl>(settings)) {}
 
 Directory::~Directory() {
   {
     const std::lock_guard<Mutex> lock(impl_->mutex);
+    impl_->interrupted = false; /* it is not told any more */
     for (const auto &[key, subscription] : impl_->installed) subscription->dropDue();
     for (const auto &registration : impl_->registrations) registration->remove();
   }
@@ -182,11 +228,14 @@ void Directory::setUsable(bool usable) {
   const std::lock_guard<Mutex> lock(impl_->mutex);
   if (impl_->usable == usable) return;
   impl_->usable = usable;
+  if (!usable) impl_->interrupted = true;
+  impl_->lastBefore.reset();
   for (const auto &registration : impl_->registrations) {
     if (registration->removed()) continue;
     registration->tellChange();
     impl_->delivery.schedule(registration);
   }
+  impl_->settle();
 }
 
 zel_Status Directory::registerStatus(KarstStatusFn fn, void *data) {
@@ -216,6 +265,7 @@ void Directory::deregisterStatus(KarstStatusFn fn, void *data) {
   std::erase_if(impl_->registrations, [](const auto &registration) {
     return registration->removed() && !registration->running();
   });
+  impl_->settle();
 }
 
 /* ---- Changes --------------------------------------------------------------------------------- */
@@ -223,7 +273,9 @@ void Directory::deregisterStatus(KarstStatusFn fn, void *data) {
 void Directory::put(Entry entry) {
   const auto present = std::make_shared<const Entry>(std::move(entry));
   const std::lock_guard<Mutex> lock(impl_->mutex);
-  SharedEntry &place = impl_->entries[Key{present->type, present->uuid}];
+  const Key key{present->type, present->uuid};
+  impl_->missed.erase(key);
+  SharedEntry &place = impl_->entries[key];
   if (place != nullptr && *place == *present) return;
   const SharedEntry before = std::exchange(place, present);
   if (before != nullptr && before->owner != present->owner) {
@@ -234,19 +286,19 @@ void Directory::put(Entry entry) {
 
 void Directory::remove(uint8_t type, const zel_UUID &uuid) {
   const std::lock_guard<Mutex> lock(impl_->mutex);
-  const auto place = impl_->entries.find(Key{type, uuid});
+  const Key key{type, uuid};
+  const auto place = impl_->entries.find(key);
   if (place == impl_->entries.end()) return;
   const SharedEntry before = std::move(place->second);
   impl_->entries.erase(place);
+  impl_->missed.insert_or_assign(key, before);
   impl_->tellMatching(*before, ZEL_NOT_FOUND);
+  impl_->settle();
 }
 
 void Directory::resync() {
   const std::lock_guard<Mutex> lock(impl_->mutex);
-  for (const auto &[key, subscription] : impl_->installed) {
-    subscription->tellResync();
-    impl_->delivery.schedule(subscription);
-  }
+  impl_->tellResync();
 }
 
 /* ---- Subscriptions --------------------------------------------------------------------------- */
@@ -258,10 +310,16 @@ zel_Status Directory::subscribe(const KarstQuery *query, KarstSubscriptionFn fn,
   const std::lock_guard<Mutex> lock(impl_->mutex);
   const auto subscription = std::make_shared<Subscription>(query, fn, data, impl_->queueBound,
                                                            &impl_->subscriptionsAlive);
-  /* In one go with the installation: what changes next is told behind what is there now. */
+  /* In one go with the installation: what changes next is told behind what is there now. What is
+   * gone comes first, so that a reader has its room free again for what is there. */
+  impl_->tellMissed(*subscription, *key);
   for (auto it = firstMatch(impl_->entries, *key); it != impl_->entries.end();
        it = nextMatch(impl_->entries, *key, it->first)) {
-    subscription->tellExisting(headerOf(*it->second));
+    subscription->tellAtStart(headerOf(*it->second), ZEL_OK);
+  }
+  /* Who looked one entry up before it subscribed may have found what is gone by now. */
+  if (!isZero(key->uuid) && impl_->entries.count(*key) == 0) {
+    subscription->tellAtStart(headerOf({key->type, key->uuid, {}, {}}), ZEL_NOT_FOUND);
   }
   impl_->installed.emplace(*key, subscription);
   impl_->delivery.schedule(subscription);

@@ -28,8 +28,8 @@ struct DirectorySettings {
   /* Threads that make the calls, at least one. A status callback may take long (a module that
    * disables itself waits for its world); the other threads deliver meanwhile. */
   unsigned deliveryThreads = 2;
-  /* Changes that a subscription may have due before it overflows. The entries that it is told of at
-   * its start do not count. */
+  /* Changes that a subscription may have due before it overflows. What it is told at its start does
+   * not count. */
   size_t queueBound = 1024;
 };
 
@@ -47,16 +47,18 @@ class Directory {
   void setSelf(const zel_UUID &uuid);
 
   /* Tells the status callbacks, on a delivery thread. Unusable at first. An interruption is told
-   * even when it is over before the callback was called; of several such, one. */
+   * even when it is over before the callback was called; of several such, one. How it ends for
+   * subscribers is said at KARST_RegisterStatusCallback. */
   void setUsable(bool usable);
 
   /* Adds or changes an entry; an equal one changes nothing and tells nobody. Where the owner
    * changes, subscribers learn first that the old pairing is gone (ZEL_NOT_FOUND with the old
    * header), then of the new one. */
   void put(Entry entry);
-  void remove(uint8_t type, const zel_UUID &uuid); /* unknown: nothing happens */
+  /* An unknown one changes nothing. A removed one takes memory until nothing is due any more. */
+  void remove(uint8_t type, const zel_UUID &uuid);
 
-  /* Tells every subscription ZEL_SUB_RESYNC in place of what it has due. */
+  /* Tells every subscription ZEL_SUB_RESYNC in place of the changes that it has due. */
   void resync();
 
   /* ---- What modules do (behind the KARST_ functions; statuses as there). --------------------- */

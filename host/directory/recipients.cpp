@@ -17,14 +17,14 @@ bool Subscription::is(const KarstQuery *query, KarstSubscriptionFn fn, void *dat
   return query_ == query && fn_ == fn && data_ == data;
 }
 
-void Subscription::tellExisting(const KarstEntryHeader &header) {
-  calls_.push_back({header, ZEL_OK});
-  ++existing_;
+void Subscription::tellAtStart(const KarstEntryHeader &header, zel_Status status) {
+  calls_.push_back({header, status});
+  ++atStart_;
 }
 
 bool Subscription::tell(const KarstEntryHeader &header, zel_Status status) {
   if (overflowed_) return false;
-  overflowed_ = calls_.size() - existing_ >= bound_;
+  overflowed_ = calls_.size() - atStart_ >= bound_;
   if (overflowed_) {
     calls_.push_back({{}, ZEL_SUB_OVERFLOW});
   } else {
@@ -34,7 +34,8 @@ bool Subscription::tell(const KarstEntryHeader &header, zel_Status status) {
 }
 
 void Subscription::tellResync() {
-  dropDue();
+  calls_.resize(atStart_);
+  overflowed_ = false;
   calls_.push_back({{}, ZEL_SUB_RESYNC});
 }
 
@@ -45,14 +46,14 @@ void Subscription::tellCancelled() {
 
 void Subscription::dropDue() {
   calls_.clear();
-  existing_ = 0;
+  atStart_ = 0;
   overflowed_ = false;
 }
 
 void Subscription::serve(std::unique_lock<Mutex> &lock) {
   const Call call = calls_.front();
   calls_.pop_front();
-  if (existing_ != 0) --existing_;
+  if (atStart_ != 0) --atStart_;
   /* Before the call: what changes from here on may be missed by what the call reads. */
   if (call.status == ZEL_SUB_OVERFLOW) overflowed_ = false;
   lock.unlock();

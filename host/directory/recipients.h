@@ -21,17 +21,20 @@ class Subscription final : public Recipient {
 
   bool is(const KarstQuery *query, KarstSubscriptionFn fn, void *data) const;
 
-  /* An entry that matched already at the start. Does not count towards the bound: whoever
-   * subscribes is told all that there is, however much. Comes before every other call. */
-  void tellExisting(const KarstEntryHeader &header);
+  /* What there is to tell at the start. Does not count towards the bound: whoever subscribes is told
+   * all that there is, however much. Comes before every other call. */
+  void tellAtStart(const KarstEntryHeader &header, zel_Status status);
 
   /* A change. Where the queue is full it is lost: the first one lost puts a ZEL_SUB_OVERFLOW behind
    * what is due, and until that call begins all that follow are lost too, since what it makes the
    * subscriber read contains them. Returns whether this was the first one lost. */
   bool tell(const KarstEntryHeader &header, zel_Status status);
 
-  /* Put one call in place of all that is due; the second is the last one ever. */
+  /* Puts one call in place of the changes that are due. What there was to tell at the start stays:
+   * who reads everything again would not find in it what had gone before. */
   void tellResync();
+
+  /* Puts one call, the last one ever, in place of all that is due. */
   void tellCancelled();
 
   void dropDue();
@@ -52,7 +55,7 @@ class Subscription final : public Recipient {
   const size_t bound_;
   size_t *const alive_;
   std::deque<Call> calls_;
-  size_t existing_ = 0;     /* calls at the front that do not count towards the bound */
+  size_t atStart_ = 0;      /* calls at the front that do not count towards the bound */
   bool overflowed_ = false; /* the last call due is the overflow's */
 };
 

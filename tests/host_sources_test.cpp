@@ -100,6 +100,13 @@ const Refusal refusals[] = {
     {node(R"("interfaces":[],"uuid":@a3)"), ": /nodes/0", R"(field "uuid" is given twice; keep)"},
     {node(R"("colour":"red")"), ": /nodes/0",
      R"(unknown field "colour"; known here: interfaces, name, rawRecord, uuid, version, witness)"},
+    {R"({"nodes":[],"a: b\nc":1})", ": top level", R"(unknown field "a: b\nc"; known here: $sch)"},
+    {R"({"a\nb":[{"c":1,"c":2}],"nodes":[]})", ": /a\\nb/0",
+     R"(field "c" is given twice; keep one)"},
+    {R"({"nodes":")" + std::string(1000, 'x'), ":1:1011",
+     "no valid JSON: syntax error while parsing value - invalid string: missing closing quote; "
+     "last read: '\"" +
+         std::string(59, 'x') + "...'"},
     {node(R"("rawRecord":"a0f")"), ": /nodes/0/rawRecord", "\"a0f\" is refused; expected: hex"},
     {R"({"nodes":[{"uuid":"node-1"}]})", ": /nodes/0/uuid",
      "\"node-1\" is refused; expected: A UUID: 32 hexadecimal digits, plain or as 8-4-4-4-12"},

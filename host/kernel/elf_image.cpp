@@ -27,11 +27,11 @@ std::string readFile(const std::filesystem::path &path) {
   const auto status = std::filesystem::status(path, error);
   if (!std::filesystem::exists(status)) refuse("there is no such file; check the path");
   if (!std::filesystem::is_regular_file(status)) refuse("is not a file; name a module file (.so)");
-  if (std::filesystem::file_size(path, error) > kLargestFile) {
-    refuse("is larger than any module; name a module file (.so)");
-  }
+  const uintmax_t size = std::filesystem::file_size(path, error);
+  if (size > kLargestFile) refuse("is larger than any module; name a module file (.so)");
   std::ifstream file(path, std::ios::binary);
-  std::string bytes{std::istreambuf_iterator<char>(file), std::istreambuf_iterator<char>()};
+  std::string bytes(size, '\0');
+  file.read(bytes.data(), static_cast<std::streamsize>(size));
   if (!file) refuse("cannot be read; check its permissions");
   return bytes;
 }

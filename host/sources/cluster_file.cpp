@@ -24,8 +24,13 @@ namespace {
 using json = nlohmann::json;
 using Path = json::json_pointer;
 
+/* The names on the way are the file's own: escaped and shortened, so that the line stays one. */
 std::string at(const Path &path) {
-  return path.empty() ? "top level" : path.to_string();
+  if (path.empty()) return "top level";
+  constexpr size_t longest = 200;
+  const std::string quoted = json(path.to_string()).dump(-1, ' ', true);
+  const std::string text = quoted.substr(1, quoted.size() - 2);
+  return text.size() > longest ? text.substr(0, longest) + "..." : text;
 }
 
 /* A rule that a place in the document breaks. */
@@ -75,7 +80,8 @@ class DuplicateFields {
 
   void beginField(const std::string &name) {
     if (!levels_.back().fields.insert(name).second) {
-      throw Refusal{pathOfObject(), "field \"" + name + "\" is given twice; keep one of the two"};
+      throw Refusal{pathOfObject(),
+                    "field " + shown(name) + " is given twice; keep one of the two"};
     }
     levels_.back().field = name;
   }
@@ -100,10 +106,19 @@ std::string positionOf(const std::string &text, size_t byte) {
   return std::to_string(line) + ":" + std::to_string(before.size() - lineStart + 1);
 }
 
-/* What the parser says, without its own prefix. */
+/* What the parser says, without its own prefix, and with little of what it read last: that may be
+ * most of the file. */
 std::string parserWords(const std::string &what, const std::string &prefixEnd) {
+  constexpr size_t longest = 60;
+  const std::string readMark = "last read: '";
   const size_t end = what.find(prefixEnd);
-  return end == std::string::npos ? what : what.substr(end + prefixEnd.size());
+  std::string words = end == std::string::npos ? what : what.substr(end + prefixEnd.size());
+  const size_t mark = words.find(readMark);
+  if (mark == std::string::npos) return words;
+  const size_t read = mark + readMark.size();
+  const size_t readEnd = std::min(words.rfind("'; expected "), words.size() - 1);
+  if (readEnd > read + longest) words.replace(read + longest, readEnd - read - longest, "...");
+  return words;
 }
 
 json parseJSON(const std::string &text, const std::string &fileName) {

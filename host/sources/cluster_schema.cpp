@@ -63,9 +63,9 @@ std::string fieldNames(const json &objectSchema) {
   return names;
 }
 
-/* The text between the first and the last of a quotation mark. */
-std::string quotedPart(const std::string &text, char mark) {
-  const size_t first = text.find(mark);
+/* The text between the first and the last of a quotation mark, behind `start`. */
+std::string quotedPart(const std::string &text, char mark, size_t start = 0) {
+  const size_t first = text.find(mark, start);
   const size_t last = text.rfind(mark);
   return first == last ? text : text.substr(first + 1, last - first - 1);
 }
@@ -77,8 +77,8 @@ bool begins(const std::string &text, const char *with) {
 /* `place` is what the fault was found in, `report` the validator's text. */
 std::string inWords(const json &place, const json &schema, const std::string &report) {
   if (begins(report, "Object contains a property that could not be validated")) {
-    const std::string field = quotedPart(report.substr(report.rfind(':')), '\'');
-    return "unknown field \"" + field + "\"; known here: " + fieldNames(resolved(schema));
+    const std::string field = quotedPart(report, '\'', report.find("constraints: "));
+    return "unknown field " + shown(field) + "; known here: " + fieldNames(resolved(schema));
   }
   if (begins(report, "Missing required property")) {
     const std::string field = quotedPart(report, '\'');

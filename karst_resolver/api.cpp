@@ -105,6 +105,7 @@ EXPORTED zel_Status KARSTResolver_Create(KARSTResolverInstance **result, uint32_
 
 EXPORTED void KARSTResolver_Destroy(KARSTResolverInstance *instance) {
   KARSTResolverCache *cache = karstResolverCache;
+  KARSTResolverCountUp(&karstResolverInstancesAlive);
   zel_UUID tracked = KARSTResolverTrackedNodeUUID(instance);
   KARST_RESOLVER_TRACE(DestroyInstance, 547, KARST_RESOLVER_TRACE_POINTER(instance),
                        instance->entryType, KARST_RESOLVER_TRACE_UUID(&instance->objectUUID),
@@ -124,6 +125,7 @@ EXPORTED void KARSTResolver_Destroy(KARSTResolverInstance *instance) {
   KARSTResolverCountDown(&cache->refCount);
   KARSTResolverUnlockCache(cache);
   KARSTResolverReleaseInstance(instance);
+  KARSTResolverCountDown(&karstResolverInstancesAlive); /* last: the module may go after it */
 }
 
 EXPORTED void KARSTResolver_SetCallback(KARSTResolverInstance *instance,

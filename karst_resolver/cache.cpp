@@ -25,6 +25,18 @@ zel_Status KARSTResolverLockCreate(KARSTResolverLock *lock, const char *name, ui
 
 /* ---- Enable and disable ---------------------------------------------------------------------- */
 
+/* From `enabled` on clients may create nodes: those that came before this host's UUID was known learn
+ * only here whether they are this host. */
+static void KARSTResolverLearnSelf(KARSTResolverCache *cache, const zel_UUID *self)
+    KARST_REQUIRES(karstResolverCacheLock) {
+  cache->selfUUID = *self;
+  for (KARSTRBTreeNode *element = KARSTRBTree_First(cache->nodeTree); element != nullptr;
+       element = KARSTRBTree_Next(cache->nodeTree, element)) {
+    KARSTResolverNode *node = KARSTResolverNodeOfTreeElem(element);
+    node->isSelf = KARSTResolverUUIDEqual(&node->uuid, self);
+  }
+}
+
 /* The steps of an enable until one fails. A function of its own, so that the reports of all of them
  * carry its name. */
 static bool KARSTResolverCacheEnable(KARSTResolverCache *cache)
@@ -35,8 +47,8 @@ static bool KARSTResolverCacheEnable(KARSTResolverCache *cache)
 
   zel_UUID self = {};
   KARST_GetSelfUUID(&self);
-  KARSTResolverLockCache(cache); /* clients may be creating nodes already: no half-written UUID */
-  cache->selfUUID = self;
+  KARSTResolverLockCache(cache);
+  KARSTResolverLearnSelf(cache, &self);
   KARSTResolverUnlockCache(cache);
 
   zel_Status status = TOLM_WorldCreate(&cache->world, "KARSTResolverCache", karstResolverModuleID,

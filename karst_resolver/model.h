@@ -186,9 +186,10 @@ extern "C" {
 
 extern KARSTResolverCache *karstResolverCache; /* null while there is none */
 
-/* Instances whose memory is not back on the heap yet. A destroyed instance may still wait for the
- * last call of its object's subscription, and no reference on the cache is left to say so: unload
- * waits for this count as well. Atomic. */
+/* Instances whose memory is not back on the heap yet, and calls of KARSTResolver_Destroy that have
+ * not ended. A destroyed instance may still wait for the last call of its object's subscription; and
+ * where that call gives up the last reference, the client's thread may still be on its way out. No
+ * reference on the cache is left to say so: unload waits for this count as well. Atomic. */
 extern uint64_t karstResolverInstancesAlive;
 
 } /* extern "C" */

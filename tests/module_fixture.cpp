@@ -44,6 +44,10 @@ sim::Settings ModuleTest::defaults() {
 ModuleTest::ModuleTest(const sim::Settings &settings) : sim(settings) {
   host::setLogSink(
       [this](const host::LogLine &line) {
+        if (line.log.empty() &&
+            (line.text.starts_with("heap ") || line.text.starts_with("lock domain "))) {
+          leftBehind.push_back(line.text);
+        }
         if (line.log != "KARSTResolver" && line.text.find("Failed to") == std::string::npos) return;
         log.push_back(std::to_string(line.urgency) + " " +
                       std::regex_replace(line.text, std::regex(":[0-9]+: "), ":N: "));
@@ -56,6 +60,7 @@ ModuleTest::~ModuleTest() {
   sim.releaseAll();
   if (module_ != nullptr) unload();
   host::setLogSink(nullptr, false);
+  EXPECT_THAT(leftBehind, ::testing::IsEmpty());
 }
 
 std::string ModuleTest::load(const std::vector<std::string> &parameters) {

@@ -16,24 +16,7 @@
 #include "host/kernel/log.h"
 #include "karst_resolver/model.h"
 #include "sim/simulation.h"
-
-/* UUIDs that are told apart at a glance: nodes, interfaces, objects. */
-constexpr zel_UUID uuidOf(uint8_t kind, uint32_t number) {
-  return {{kind, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, static_cast<uint8_t>(number >> 24),
-           static_cast<uint8_t>(number >> 16), static_cast<uint8_t>(number >> 8),
-           static_cast<uint8_t>(number)}};
-}
-constexpr zel_UUID nodeUUID(uint32_t number) {
-  return uuidOf(0xa0, number);
-}
-constexpr zel_UUID netIfUUID(uint32_t number) {
-  return uuidOf(0xb0, number);
-}
-constexpr zel_UUID objectUUID(uint32_t number) {
-  return uuidOf(0xc0, number);
-}
-constexpr zel_UUID noUUID{};
-constexpr uint8_t objectType = 20;
+#include "tests/uuids.h"
 
 /* An address of a locator, as text: "10.0.0.1", "fd00::1", "local". */
 std::string textOf(const KARSTResolverNodeLocator &locator);
@@ -115,6 +98,8 @@ class ModuleTest : public ::testing::Test {
   std::vector<std::string> calls(std::initializer_list<sim::Call> which);
 
   std::vector<std::string> log; /* the module's lines, with line numbers cut out */
+  /* What the host found alive at the end of the module's heap and lock domain. */
+  std::vector<std::string> leftBehind;
   sim::Simulation sim;
 
  private:

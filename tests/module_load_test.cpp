@@ -1,4 +1,4 @@
-/* Loading, every failure of loading, unloading; the module's memory; what it declares. */
+/* Loading and unloading; the module's memory; what it declares. */
 #include "host/kernel/module_file.h"
 #include "platform/tolm.h"
 #include "tests/module_fixture.h"
@@ -32,62 +32,6 @@ TEST_F(Load, BuildsInOrderAndUnloadsInReverse) {
                           "KARST_DeregisterStatusCallback", "zel_SpinlockDestroy",
                           "zel_LockDomainDestroy", "zel_HeapDestroy", "Tolm_LogCleanup"));
   EXPECT_THAT(sim.alive(), IsEmpty());
-}
-
-/* Whatever fails, once or from there on: its report, nothing left behind, and success afterwards.
- */
-TEST_F(Load, FailsCleanlyAtEveryStep) {
-  struct Row {
-    Call call;
-    uint64_t nth;
-    std::vector<std::string> report;
-  };
-  const std::string name = "2 KARSTResolver: ";
-  const Row rows[] = {
-      {Call::Tolm_LogInit, 1, {}},
-      {Call::zel_HeapCreate,
-       1,
-       {name + "KARSTResolverInit:N: Failed to create heap: ZEL_NO_MEMORY"}},
-      {Call::zel_LockDomainCreate,
-       1,
-       {name + "KARSTResolverInit:N: Failed to create lock domain: ZEL_NO_MEMORY"}},
-      {Call::zel_HeapAllocWithRA, 1, {}}, /* the cache itself */
-      {Call::zel_SpinlockCreate,
-       1,
-       {name + "KARSTResolverCacheInit:N: Failed to create spinlock: ZEL_NO_MEMORY"}},
-      {Call::zel_HeapAllocWithRA,
-       2,
-       {name + "KARSTResolverCacheInit:N: Failed to allocate node pool"}},
-      {Call::zel_HeapAllocWithRA,
-       3,
-       {name + "KARSTResolverCacheInit:N: Failed to allocate netif pool"}},
-      {Call::zel_HeapAllocWithRA,
-       4,
-       {name + "KARSTResolverCacheInit:N: Failed to allocate node rbtree"}},
-      {Call::zel_HeapAllocWithRA,
-       5,
-       {name + "KARSTResolverCacheInit:N: Failed to allocate node rbtree"}},
-      {Call::zel_HeapAllocWithRA,
-       6,
-       {name + "KARSTResolverCacheInit:N: Failed to allocate node rbtree"}},
-      {Call::KARST_RegisterStatusCallback,
-       1,
-       {name + "KARSTResolverCacheInit:N: Failed to register KARST status callback"}},
-  };
-  for (const Row &row : rows) {
-    for (uint64_t count : {uint64_t{1}, sim::Machine::everyFurther}) {
-      SCOPED_TRACE(std::string(sim::traits(row.call).name) + " at " + std::to_string(row.nth));
-      uint64_t before = sim.faultsInjected();
-      sim.failAt(row.call, row.nth, count);
-      EXPECT_NE(load(), "");
-      EXPECT_GT(sim.faultsInjected(), before);
-      EXPECT_EQ(log, row.report);
-      EXPECT_THAT(sim.alive(), IsEmpty());
-      sim.clearFaults();
-      log.clear();
-    }
-  }
-  EXPECT_EQ(load(), "");
 }
 
 TEST_F(Load, SpinlockFailureKeepsItsStatus) {

@@ -1,0 +1,54 @@
+/* What the directory says that the module must hold, worked out from the entries alone, and where a
+ * cache differs from it. No lock is taken: ask while no thread is inside the module.
+ */
+#pragma once
+
+#include <map>
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "host/directory/directory.h"
+#include "host/kernel/uuid.h"
+#include "karst_resolver/model.h"
+
+/* An instance that a client holds, and what its callback was told last; none: it has none. */
+struct HeldInstance {
+  const KARSTResolverInstance *instance;
+  std::optional<uint32_t> told;
+};
+
+/* A test that made reads fail takes out of a view what the module cannot know. */
+struct DirectoryView {
+  struct NetIf {
+    KarstNetInterfaceEntry info;
+    KarstHealthStatusEntry health; /* all ones: there is no entry */
+    bool subscribed = true;        /* to its health */
+  };
+  struct Instance {
+    HeldInstance held;
+    zel_UUID node; /* that it tracks; zero: none */
+  };
+  zel_UUID self{};
+  bool witnessHost = false;
+  bool enabled = true; /* else nothing but the nodes that instances are attached to is cached */
+  std::map<zel_UUID, KarstNodeEntry> nodes;              /* those that are reachable */
+  std::map<std::pair<zel_UUID, zel_UUID>, NetIf> netIfs; /* by owner and UUID */
+  std::vector<Instance> instances;
+};
+
+/* Entries that cannot be decoded are left out. An object whose entry is gone leaves its instance
+ * with its hint node, where that still counts, or with none; that an instance has been asked for a
+ * second node is taken from itself. `held`: every instance that is not destroyed. */
+DirectoryView viewOf(const host::Directory &directory, const zel_UUID &self, bool witnessHost,
+                     const std::vector<HeldInstance> &held = {});
+
+/* What is broken in the cache itself, a line each: tree, lists, slots, tags, reference counts of
+ * nodes and interfaces. True at any time when the cache lock is free and the world waits. */
+std::vector<std::string> damageOf(const KARSTResolverCache *cache);
+
+/* Damage, or else every difference from the view, a line each; none: they are equal. To be asked
+ * when nothing is due any more. Needs a directory that fits into the cache's slots. A new version
+ * or witness flag of a node alone changes no locators: have each such node marked dirty before. */
+std::vector<std::string> differencesOf(const KARSTResolverCache *cache, const DirectoryView &view);

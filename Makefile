@@ -1,9 +1,11 @@
 # What people type; CMake presets do the work (CMakePresets.json).
 JOBS ?= $(shell nproc)
 RELEASE := build/release
+SIM_STEPS ?= 600e6
+SIM_PLAIN_STEPS ?= 60e6
 
 .DEFAULT_GOAL := help
-.PHONY: help run build test check format bench clean
+.PHONY: help run build test check sim mutants fuzz coverage format bench clean
 
 help: ## show this list
 	@awk -F ':.*## ' '/^[a-z]+:.*## /{printf "  make %-8s %s\n", $$1, $$2}' Makefile
@@ -25,6 +27,27 @@ test: ## install what is needed, build, and run every test
 check: ## format, lint, lock discipline, the module's promises as an object, and the sanitizers
 	tools/install-deps build test check
 	tools/check
+
+sim: ## search schedules and failures, SIM_STEPS (600e6) of them with every access watched
+	tools/install-deps build test
+	cmake --preset tests >/dev/null
+	cmake --build --preset tests -j $(JOBS) --target karst-sim karst_resolver karst_resolver_watched
+	$(RELEASE)/karst-sim --watched --steps $(SIM_STEPS)
+	$(RELEASE)/karst-sim --plain --steps $(SIM_PLAIN_STEPS)
+
+mutants: ## plant faults one by one; each must be found
+	tools/install-deps build test
+	tools/mutants
+
+fuzz: ## throw bytes at every reader, FUZZ_SECONDS (60) each
+	tools/install-deps build test fuzz
+	cmake --preset fuzz >/dev/null
+	cmake --build --preset fuzz -j $(JOBS)
+	tools/fuzz
+
+coverage: ## how much of the module the tests run, line by line: build/coverage/html
+	tools/install-deps build test coverage
+	tools/coverage
 
 format: ## lay the sources out as .clang-format says
 	tools/install-deps check

@@ -6,6 +6,8 @@
 #include <algorithm>
 
 #include "host/kernel/panic.h"
+#include "sim/access/access.h"
+#include "sim/lock_order.h"
 #include "sim/machine.h"
 #include "sim/observer.h"
 
@@ -34,8 +36,12 @@ zel_Status CallbackTable::subscribe(host::Directory &directory, const KarstQuery
                                     KarstSubscriptionFn fn, void *data) {
   if (!query || !fn) return ZEL_BAD_PARAM;
   subscriptions_.push_back({this, query, fn, data, query->type});
+  access::publish(&subscriptions_.back());
   const zel_Status status = directory.subscribe(query, &callSubscriber, &subscriptions_.back());
-  if (status != ZEL_OK) subscriptions_.pop_back();
+  if (status != ZEL_OK) {
+    access::forget(&subscriptions_.back());
+    subscriptions_.pop_back();
+  }
   return status;
 }
 
@@ -46,6 +52,7 @@ void CallbackTable::unsubscribe(host::Directory &directory, const KarstQuery *qu
         return !one.cancelled && one.query == query && one.fn == fn && one.data == data;
       });
   if (found == subscriptions_.end()) return;
+  access::publish(&found->cancelled);
   found->cancelled = true;
   directory.unsubscribe(query, &callSubscriber, &*found);
 }
@@ -55,13 +62,21 @@ zel_Status CallbackTable::callSubscriber(void *record, const KarstEntryHeader *h
   auto &subscription = *static_cast<Subscription *>(record);
   Machine &machine = Machine::current();
   Fiber &fiber = machine.scheduler().running();
+  access::observe(&subscription);
+  if (status == ZEL_SUB_CANCELLED) access::observe(&subscription.cancelled);
   const SubscriptionCall call{subscription.fn, subscription.data, subscription.type, header,
                               status};
   if (Observer *observer = machine.observer()) observer->subscriptionCalls(fiber, call);
+  machine.note("subscription is called",
+               Argument::entry(call.type, header ? header->uuid : zel_UUID{}), status);
   const zel_Status result = call.fn(call.data, header, argument, status);
+  machine.note("subscription returns", {});
   requireNoSpinlock(fiber, "returns from a subscription's callback");
+  access::publish(&subscription);
   if (Observer *observer = machine.observer()) observer->subscriptionReturned(fiber, call);
   if (status == ZEL_SUB_CANCELLED) {
+    access::forget(&subscription);
+    access::forget(&subscription.cancelled);
     subscription.table->subscriptions_.remove_if(
         [&](const Subscription &one) { return &one == &subscription; });
   }
@@ -73,15 +88,30 @@ zel_Status CallbackTable::callSubscriber(void *record, const KarstEntryHeader *h
 zel_Status CallbackTable::registerStatus(host::Directory &directory, KarstStatusFn fn, void *data) {
   if (!fn) return ZEL_BAD_PARAM;
   registrations_.push_back({fn, data});
+  access::publish(&registrations_.back());
   const zel_Status status = directory.registerStatus(&callStatus, &registrations_.back());
-  if (status != ZEL_OK) registrations_.pop_back();
+  if (status != ZEL_OK) {
+    access::forget(&registrations_.back());
+    registrations_.pop_back();
+  }
+  Machine &machine = Machine::current();
+  if (Observer *observer = machine.observer())
+    observer->statusRegistered(machine.scheduler().running(), data, status);
   return status;
 }
 
 void CallbackTable::deregisterStatus(host::Directory &directory, KarstStatusFn fn, void *data) {
+  const Fiber &fiber = Machine::current().scheduler().running();
+  const uint8_t running = LockOrder::classOf(insideStatusCallback);
+  /* From inside a call it does not wait for that call. */
+  const auto entered = fiber.inside.begin() + fiber.insideCount;
+  if (std::find(fiber.inside.begin(), entered, running) == entered)
+    LockOrder::requireOrder(fiber, running);
   for (auto it = registrations_.begin(); it != registrations_.end();) {
     if (it->fn == fn && it->data == data) {
       directory.deregisterStatus(&callStatus, &*it);
+      access::observe(&*it);
+      access::forget(&*it);
       it = registrations_.erase(it);
     } else {
       ++it;
@@ -91,11 +121,18 @@ void CallbackTable::deregisterStatus(host::Directory &directory, KarstStatusFn f
 
 void CallbackTable::callStatus(void *record, uint32_t status) {
   const Registration registration = *static_cast<Registration *>(record);
+  access::observe(record);
   Machine &machine = Machine::current();
   Fiber &fiber = machine.scheduler().running();
   if (Observer *observer = machine.observer()) observer->statusCalls(fiber, status);
-  registration.fn(registration.data, status);
+  machine.note("status is called", Argument::number(status));
+  {
+    const Inside inside(fiber, insideStatusCallback);
+    registration.fn(registration.data, status);
+  }
+  machine.note("status returns", {});
   requireNoSpinlock(fiber, "returns from a status callback");
+  access::publish(record);
   if (Observer *observer = machine.observer()) observer->statusReturned(fiber, status);
 }
 

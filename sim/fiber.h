@@ -15,6 +15,9 @@ namespace sim {
 class Fiber;
 struct Spinlock;
 struct World;
+namespace access {
+struct Strand;
+}
 
 inline constexpr uint64_t never = UINT64_MAX; /* a virtual time that does not come */
 
@@ -62,7 +65,14 @@ class Fiber {
   std::array<Spinlock *, 16> held{};
   uint32_t heldCount = 0;
 
-  uint32_t callDepth = 0; /* platform calls that this fiber is inside of */
+  /* What else it is inside of that others may wait for, by class (lock_order.h), outermost first. */
+  std::array<uint8_t, 8> inside{};
+  uint32_t insideCount = 0;
+
+  mutable access::Strand *strand = nullptr; /* what the recorder of its accesses keeps; or null */
+
+  uint32_t callDepth = 0;         /* platform calls that this fiber is inside of */
+  const void *callSite = nullptr; /* where the outermost of them was called from */
 
   const char *stackTop() const { return stackTop_; }
   const char *stackBottom() const { return stackBottom_; }

@@ -4,9 +4,12 @@
 #include <algorithm>
 #include <bit>
 #include <cstring>
+#include <functional>
+#include <map>
 
 #include "host/kernel/text.h"
 #include "host/kernel/uuid.h"
+#include "sim/sketch.h"
 
 namespace sim {
 
@@ -68,24 +71,12 @@ std::string Argument::toString() const {
   return "";
 }
 
-namespace {
-
-/* Statuses by name; nothing for a call whose zero says nothing. */
-std::string resultText(const HistoryEntry &entry) {
-  const auto status = static_cast<zel_Status>(entry.result);
-  if (traits(entry.call).fault != ZEL_OK || status >= ZEL_FAILURE)
-    return std::string("  -> ") + host::statusText(status);
-  return entry.result != 0 ? "  -> " + std::to_string(entry.result) : "";
-}
-
-}  // namespace
-
 /* ---- The ring -------------------------------------------------------------------------------- */
 
 bool HistoryEntry::operator==(const HistoryEntry &other) const {
   return step == other.step && time == other.time && fiber == other.fiber && call == other.call &&
-         returned == other.returned && injected == other.injected && result == other.result &&
-         argument == other.argument && *fiberName == *other.fiberName;
+         note == other.note && returned == other.returned && injected == other.injected &&
+         result == other.result && argument == other.argument && *fiberName == *other.fiberName;
 }
 
 History::History(size_t length) {
@@ -107,19 +98,92 @@ std::vector<HistoryEntry> History::entries() const {
   return entries;
 }
 
-std::string History::timeline(size_t lines) const {
-  std::vector<HistoryEntry> all = entries();
-  const size_t first = all.size() > lines ? all.size() - lines : 0;
+void History::noteSuccession(const HistoryEntry &entry) {
+  const uint64_t call =
+      std::hash<std::string>()(*entry.fiberName) * callCount + static_cast<uint64_t>(entry.call);
+  if (entry.fiber != lastFiber_) successions_->add(lastCall_ * 0x9e3779b97f4a7c15u ^ call);
+  lastFiber_ = entry.fiber;
+  lastCall_ = call;
+}
+
+/* ---- For people ------------------------------------------------------------------------------ */
+
+namespace {
+
+/* Statuses by name; nothing for a call whose zero says nothing. */
+std::string resultText(const HistoryEntry &entry) {
+  if (!entry.returned) return entry.note ? "" : "  ...";
+  const auto status = static_cast<zel_Status>(entry.result);
+  const bool isStatus = entry.note || traits(entry.call).fault != ZEL_OK || status >= ZEL_FAILURE;
   std::string text;
-  for (size_t i = first; i < all.size(); ++i) {
-    const HistoryEntry &entry = all[i];
-    const char *end = !entry.returned ? "  ..." : entry.injected ? "  injected" : "";
-    const std::string result = entry.returned ? resultText(entry) : "";
-    text += host::formatText(
-        "%8llu %6llu us  %-22s %s(%s)%s%s\n", static_cast<unsigned long long>(entry.step),
-        static_cast<unsigned long long>(entry.time / 1000), entry.fiberName->c_str(),
-        traits(entry.call).name, entry.argument.toString().c_str(), result.c_str(), end);
+  if (isStatus)
+    text = std::string("  -> ") + host::statusText(status);
+  else if (entry.result != 0)
+    text = "  -> " + std::to_string(entry.result);
+  return entry.injected ? text + "  injected" : text;
+}
+
+/* Who holds which spinlocks, followed through the entries. */
+class Holding {
+ public:
+  void follow(const HistoryEntry &entry) {
+    if (entry.note || !entry.returned) return;
+    std::vector<std::string> &held = held_[entry.fiber];
+    const std::string lock = entry.argument.toString();
+    if (entry.call == Call::zel_SpinlockLock) held.push_back(lock);
+    if (entry.call != Call::zel_SpinlockUnlock) return;
+    const auto found = std::find(held.rbegin(), held.rend(), lock);
+    if (found != held.rend()) held.erase(found.base() - 1);
   }
+  std::string of(uint32_t fiber) const {
+    const auto found = held_.find(fiber);
+    if (found == held_.end()) return "";
+    std::string text;
+    for (const std::string &lock : found->second) text += (text.empty() ? "  [" : ", ") + lock;
+    return text.empty() ? text : text + "]";
+  }
+
+ private:
+  std::map<uint32_t, std::vector<std::string>> held_;
+};
+
+std::string what(const HistoryEntry &entry) {
+  const std::string argument = entry.argument.toString();
+  if (entry.note) return std::string("* ") + entry.note + (argument.empty() ? "" : " ") + argument;
+  return std::string(traits(entry.call).name) + "(" + argument + ")";
+}
+
+/* The same again, one step or more later. */
+bool repeats(const HistoryEntry &entry, const HistoryEntry &before) {
+  HistoryEntry moved = entry;
+  moved.step = before.step;
+  return moved == before;
+}
+
+std::string lineOf(const HistoryEntry &entry, bool takesOver, const std::string &held) {
+  return host::formatText(
+      "%8llu %6llu us  %-22s %s%s%s", static_cast<unsigned long long>(entry.step),
+      static_cast<unsigned long long>(entry.time / 1000), takesOver ? entry.fiberName->c_str() : "",
+      what(entry).c_str(), resultText(entry).c_str(), held.c_str());
+}
+
+}  // namespace
+
+std::string History::timeline(size_t lines) const {
+  const std::vector<HistoryEntry> all = entries();
+  std::vector<std::string> table;
+  Holding holding;
+  for (size_t i = 0, next; i < all.size(); i = next) {
+    next = i + 1;
+    while (next < all.size() && repeats(all[next], all[i])) ++next;
+    for (size_t same = i; same < next; ++same) holding.follow(all[same]);
+    const bool takesOver = i == 0 || all[i - 1].fiber != all[i].fiber;
+    table.push_back(lineOf(all[i], takesOver, holding.of(all[i].fiber)));
+    if (next > i + 1) table.back() += "  " + std::to_string(next - i) + " times";
+  }
+  std::string text;
+  for (size_t i = table.size() > lines ? table.size() - lines : 0; i < table.size(); ++i)
+    text += table[i] + "\n";
   return text;
 }
 

@@ -1,5 +1,5 @@
-/* What happened: the last platform calls, each with its fiber, its key argument and its result, in
- * a ring of fixed size. One OS thread, no lock.
+/* What happened: the last platform calls, and what was noted between them, each with its fiber, its
+ * key argument and its result, in a ring of fixed size. One OS thread, no lock.
  */
 #pragma once
 
@@ -11,6 +11,8 @@
 #include "sim/fiber.h"
 
 namespace sim {
+
+class Sketch;
 
 /* What a call was about: a number, a UUID with its entry type, or a name. Never an address, which
  * would differ between two equal runs. */
@@ -38,9 +40,10 @@ struct HistoryEntry {
   uint64_t time = 0; /* virtual nanoseconds */
   uint32_t fiber = 0;
   Call call{};
-  bool returned = false; /* else it goes on, or its fiber was abandoned in it */
-  bool injected = false; /* the result was made to be a failure */
-  uint64_t result = 0;   /* a status, a Boolean, a count; 0 for calls without a result */
+  const char *note = nullptr; /* instead of a call: what begins here; a text that stays */
+  bool returned = false;      /* else it goes on, or its fiber was abandoned in it */
+  bool injected = false;      /* the result was made to be a failure */
+  uint64_t result = 0;        /* a status, a Boolean, a count; 0 for calls without a result */
   Argument argument;
   const std::string *fiberName = nullptr;
   bool operator==(const HistoryEntry &other) const; /* all but the addresses */
@@ -52,6 +55,7 @@ class History {
 
   /* A call begins; the number names it to end(). */
   uint64_t begin(const HistoryEntry &entry) {
+    if (successions_) noteSuccession(entry);
     if (!ring_.empty()) ring_[made_ & mask_] = entry;
     return made_++;
   }
@@ -62,19 +66,38 @@ class History {
     entry.injected = injected;
     entry.returned = true;
   }
+  void note(const HistoryEntry &entry) {
+    if (!ring_.empty()) ring_[made_ & mask_] = entry;
+    ++made_;
+  }
   void clear();
 
   /* The last calls, oldest first. */
   std::vector<HistoryEntry> entries() const;
 
-  /* The last `lines` of them as a table for people. */
+  /* The last `lines` of them as a table for people: a fiber's name where it takes over, and the
+   * spinlocks that it holds after the call, as far as they were taken within the entries. */
   std::string timeline(size_t lines) const;
 
+  /* Every history of the process tells `sketch` of calls that follow directly on a call of another
+   * fiber: which call of whom on which call of whom. Null: none. */
+  static void setSuccessions(Sketch *sketch) { successions_ = sketch; }
+
+  /* How many lines the report of a panic shows. */
+  static void setReportLines(size_t lines) { reportLines_ = lines; }
+  static size_t reportLines() { return reportLines_; }
+
  private:
+  void noteSuccession(const HistoryEntry &entry);
+
+  inline static Sketch *successions_ = nullptr;
+  inline static size_t reportLines_ = 60;
   std::vector<HistoryEntry> ring_; /* a power of two */
   uint64_t mask_ = 0;
   uint64_t made_ = 0;
   uint64_t cleared_ = 0; /* calls before this one are forgotten */
+  uint32_t lastFiber_ = 0;
+  uint64_t lastCall_ = 0; /* whose call of what, hashed */
 };
 
 }  // namespace sim

@@ -9,6 +9,8 @@
 #include "host/kernel/heap.h"
 #include "host/kernel/log.h"
 #include "host/kernel/panic.h"
+#include "sim/access/access.h"
+#include "sim/lock_order.h"
 #include "sim/observer.h"
 #include "sim/platform_call.h"
 
@@ -75,6 +77,7 @@ void forget(Fiber &fiber, const Spinlock &lock) {
 void release(Spinlock &lock) {
   const zel_HeapID heap = lock.heap;
   lock.tag = ~Spinlock::alive;
+  access::forget(&lock);
   host::heapFree(heap, &lock);
 }
 
@@ -103,11 +106,13 @@ using namespace sim;
 extern "C" zel_Status zel_LockDomainCreate(zel_ModuleID, zel_HeapID heap, const zel_Name *name,
                                            zel_LockDomainID *domain) {
   PlatformCall call(Call::zel_LockDomainCreate, Argument::name(*name));
+  access::noteRead(name, sizeof *name);
   if (call.fault()) return call.fault();
   void *memory = host::heapAlloc(heap, sizeof(LockDomain), __builtin_return_address(0));
   if (!memory) return call.returns(ZEL_NO_MEMORY);
   auto *created = new (memory) LockDomain{*name, heap};
   call.machine().locks().domains.push_back(created);
+  access::noteWrite(domain, sizeof *domain);
   *domain = reinterpret_cast<zel_LockDomainID>(created);
   return call.returns(ZEL_OK);
 }
@@ -136,6 +141,7 @@ extern "C" uint32_t zel_SpinlockAllocSize(uint32_t type) {
 
 extern "C" zel_Status zel_SpinlockCreate(const zel_SpinlockProps *props, zel_SpinlockHandle *lock) {
   PlatformCall call(Call::zel_SpinlockCreate, Argument::name(props->name));
+  access::noteRead(props, sizeof *props);
   if (call.fault()) return call.fault();
   LockDomain *domain = findDomain(props->domain);
   if (props->type != ZEL_SPINLOCK_RANKED || !domain || !isHeap(props->heap))
@@ -145,9 +151,11 @@ extern "C" zel_Status zel_SpinlockCreate(const zel_SpinlockProps *props, zel_Spi
   auto *created = new (memory) Spinlock;
   created->name = props->name;
   created->rank = props->rank;
+  created->lockClass = LockOrder::classOf(props->name.text);
   created->heap = props->heap;
   created->domain = domain;
   domain->locks.push_back(created);
+  access::noteWrite(lock, sizeof *lock);
   *lock = reinterpret_cast<zel_SpinlockHandle>(created);
   return call.returns(ZEL_OK);
 }
@@ -165,6 +173,7 @@ extern "C" void zel_SpinlockLock(zel_SpinlockHandle handle) {
   PlatformCall call(Call::zel_SpinlockLock, Argument::name(lock.name));
   Fiber &fiber = call.fiber();
   requireOrder(lock, fiber);
+  LockOrder::requireOrder(fiber, lock.lockClass);
   while (lock.holder) {
     call.machine().scheduler().block(
         lock.waiters, {.what = "spinlock", .object = lock.name.text, .holder = lock.holder});
@@ -173,6 +182,7 @@ extern "C" void zel_SpinlockLock(zel_SpinlockHandle handle) {
   }
   lock.holder = &fiber;
   fiber.held[fiber.heldCount++] = &lock;
+  access::observe(&lock);
   if (Observer *observer = call.machine().observer()) observer->locked(fiber, lock);
 }
 
@@ -185,6 +195,7 @@ extern "C" void zel_SpinlockUnlock(zel_SpinlockHandle handle) {
                 lock.holder ? "but held by " : "while nobody holds it",
                 lock.holder ? lock.holder->name().c_str() : "");
   if (Observer *observer = call.machine().observer()) observer->unlocking(fiber, lock);
+  access::publish(&lock);
   lock.holder = nullptr;
   forget(fiber, lock);
   call.machine().scheduler().wakeAll(lock.waiters);

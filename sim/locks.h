@@ -22,6 +22,7 @@ struct Spinlock {
   zel_Name name{};
   uint16_t rank = 0;
   zel_HeapID heap = ZEL_NO_HEAP;
+  uint8_t lockClass = 0; /* of its name; see lock_order.h */
   LockDomain *domain = nullptr;
   Fiber *holder = nullptr;
   WaitQueue waiters{};

@@ -9,6 +9,7 @@
 #include "host/kernel/log.h"
 #include "host/kernel/panic.h"
 #include "host/kernel/text.h"
+#include "sim/access/recorder.h"
 #include "sim/platform_call.h"
 
 namespace sim {
@@ -34,7 +35,7 @@ Machine::Machine(const Settings &settings)
     return host::formatText("seed %llu, step %llu; the last calls:\n",
                             static_cast<unsigned long long>(settings_.seed),
                             static_cast<unsigned long long>(scheduler_.steps())) +
-           timeline();
+           timeline(History::reportLines());
   });
 }
 
@@ -49,11 +50,28 @@ Machine &Machine::current() {
   return *onlyMachine;
 }
 
+Machine *Machine::existing() {
+  return onlyMachine;
+}
+
+access::Recorder &Machine::watch() {
+  if (!recorder_) recorder_ = std::make_unique<access::Recorder>(scheduler_);
+  return *recorder_;
+}
+
 /* ---- Running --------------------------------------------------------------------------------- */
 
 Task Machine::spawn(const std::string &name, std::function<void()> body) {
-  auto ended = std::make_shared<bool>(false);
-  scheduler_.spawn(name, std::move(body), [ended] { *ended = true; });
+  const auto end = [](bool *flag) {
+    access::forget(flag);
+    delete flag;
+  };
+  const std::shared_ptr<bool> ended(new bool(false), end);
+  Fiber &fiber = scheduler_.spawn(name, std::move(body), [ended] {
+    access::publish(ended.get());
+    *ended = true;
+  });
+  access::passOn(fiber);
   return Task(std::move(ended));
 }
 
@@ -68,6 +86,7 @@ bool Machine::step(uint64_t steps) {
 void Machine::finish(const Task &task) {
   if (scheduler_.drive({.until = task.ended_.get()}) == Scheduler::Stop::Quiet)
     scheduler_.reportDeadlock("what was called cannot end");
+  access::observe(task.ended_.get());
 }
 
 void Machine::advance(std::chrono::nanoseconds duration) {
@@ -112,6 +131,18 @@ void Machine::settleAndRequireNothingLeft() {
   host::panic("%s", text.c_str());
 }
 
+void Machine::note(const char *what, const Argument &argument, std::optional<zel_Status> status) {
+  const Fiber &fiber = scheduler_.running();
+  history_.note({.step = scheduler_.steps(),
+                 .time = scheduler_.now(),
+                 .fiber = fiber.id(),
+                 .note = what,
+                 .returned = status.has_value(),
+                 .result = status.value_or(ZEL_OK),
+                 .argument = argument,
+                 .fiberName = &fiber.name()});
+}
+
 /* ---- Failures and preemption ----------------------------------------------------------------- */
 
 void Machine::failAt(Call call, uint64_t nth, uint64_t count, std::optional<zel_Status> status) {
@@ -137,10 +168,11 @@ bool Machine::answersPreemption() {
 
 /* ---- Around every platform call -------------------------------------------------------------- */
 
-PlatformCall::PlatformCall(Call call, const Argument &argument)
+PlatformCall::PlatformCall(Call call, const Argument &argument, const void *caller)
     : machine_(Machine::current()), fiber_(machine_.scheduler_.running()) {
   if (traits(call).where == Where::Unlocked) requireNoSpinlock(fiber_, "calls", traits(call).name);
   const bool nested = fiber_.callDepth++ > 0;
+  if (!nested) fiber_.callSite = caller;
   if (!nested) machine_.scheduler_.point();
 
   Machine::Faults &faults = machine_.faults_[static_cast<size_t>(call)];

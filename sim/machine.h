@@ -28,6 +28,10 @@
 
 namespace sim {
 
+namespace access {
+class Recorder;
+}
+
 class Observer;
 
 enum class Switching {
@@ -68,7 +72,8 @@ class Machine {
   Machine(const Machine &) = delete;
   Machine &operator=(const Machine &) = delete;
 
-  static Machine &current(); /* panics when there is none */
+  static Machine &current();  /* panics when there is none */
+  static Machine *existing(); /* null when there is none */
 
   const Settings &settings() const { return settings_; }
 
@@ -140,6 +145,12 @@ class Machine {
 
   std::vector<HistoryEntry> history() const { return history_.entries(); }
   void clearHistory() { history_.clear(); }
+
+  /* Writes into the history that something happens on the running fiber that is no platform call: a
+   * step of the test, a call into a module. `what` is a text that stays, `status` what is handed
+   * over with it. */
+  void note(const char *what, const Argument &argument,
+            std::optional<zel_Status> status = std::nullopt);
   std::string timeline(size_t lines = 60) const { return history_.timeline(lines); }
 
   /* Over every choice of the scheduler and every call with its argument and result: equal for two
@@ -150,6 +161,10 @@ class Machine {
   /* All that is alive: fibers that were spawned, worlds, locks, domains, heaps with their blocks,
    * logs; a line each. Empty when everything was given back. */
   virtual std::vector<std::string> alive() const;
+
+  /* The recorder of memory accesses. Made at the first use, at the latest when an instrumented
+   * module is loaded; what happens before is not recorded. */
+  access::Recorder &watch();
 
   /* ---- For the platform's functions. --------------------------------------------------------- */
 
@@ -193,6 +208,7 @@ class Machine {
   uint32_t lastOwnFiber_ = 0; /* the fibers with ids up to this are the host's own */
   Preemption preemption_ = Preemption::Never;
   uint64_t forcedPreemptions_ = 0;
+  std::unique_ptr<access::Recorder> recorder_; /* goes first: it uses the scheduler */
 };
 
 }  // namespace sim

@@ -51,6 +51,7 @@ class Observer {
   virtual void subscriptionCalls(Fiber &, const SubscriptionCall &) {}
   virtual void subscriptionReturned(Fiber &, const SubscriptionCall &) {}
 
+  virtual void statusRegistered(Fiber &, void * /*data*/, zel_Status) {} /* before any call */
   virtual void statusCalls(Fiber &, uint32_t /*status*/) {}
   virtual void statusReturned(Fiber &, uint32_t /*status*/) {}
 

@@ -1,6 +1,7 @@
 /* The platform's functions that are no worlds or spinlocks: each stops at a point of the scheduler,
  * is written into the history, fails when it was asked to, and then does the host's own work.
  */
+#include <algorithm>
 #include <cstdarg>
 #include <cstdio>
 
@@ -14,6 +15,7 @@
 #include "platform/karst_directory.h"
 #include "platform/qxt.h"
 #include "platform/tolm.h"
+#include "sim/access/access.h"
 #include "sim/observer.h"
 #include "sim/platform_call.h"
 #include "sim/simulation.h"
@@ -38,6 +40,12 @@ void report(PlatformCall &call, const Lookup &lookup) {
   if (Observer *observer = call.machine().observer()) observer->lookedUp(call.fiber(), lookup);
 }
 
+/* The directory has stored a whole entry in a block of the caller's, and where that is. */
+void noteWhole(KarstFullEntry *const *entry) {
+  access::noteWrite(entry, sizeof *entry);
+  access::noteWrite(*entry, sizeof **entry + (*entry)->header.dataLength);
+}
+
 }  // namespace
 
 /* ---- Names, text ----------------------------------------------------------------------------- */
@@ -49,6 +57,8 @@ extern "C" const char *zel_StatusToString(zel_Status status) {
 
 extern "C" void zel_NameInitialize(zel_Name *name, const char *text) {
   PlatformCall call(Call::zel_NameInitialize, Argument::text(text));
+  access::noteText(text);
+  access::noteWrite(name, sizeof *name);
   host::fillName(name, text);
 }
 
@@ -58,6 +68,8 @@ extern "C" int zel_Snprintf(char *buffer, size_t size, const char *format, ...) 
   va_start(arguments, format);
   const int length = std::vsnprintf(buffer, size, format, arguments);
   va_end(arguments);
+  access::noteText(format);
+  if (length >= 0) access::noteWrite(buffer, std::min(size, static_cast<size_t>(length) + 1));
   return call.returns(length);
 }
 
@@ -66,7 +78,10 @@ extern "C" int zel_Snprintf(char *buffer, size_t size, const char *format, ...) 
 extern "C" zel_Status zel_HeapCreate(const zel_HeapProps *props, zel_HeapID *heap) {
   PlatformCall call(Call::zel_HeapCreate, Argument::name(props->name));
   if (call.fault()) return call.fault();
-  return call.returns(host::heapCreate(*props, heap));
+  access::noteRead(props, sizeof *props);
+  const zel_Status status = host::heapCreate(*props, heap);
+  if (status == ZEL_OK) access::noteWrite(heap, sizeof *heap);
+  return call.returns(status);
 }
 
 extern "C" void zel_HeapDestroy(zel_HeapID heap) {
@@ -121,11 +136,14 @@ extern "C" zel_Status Tolm_LogInit(const char *name, zel_ModuleID moduleID, uint
                                    uint32_t, zel_Log **log) {
   PlatformCall call(Call::Tolm_LogInit, Argument::text(name));
   if (call.fault()) return call.fault();
-  return call.returns(host::logOpen(name, moduleID, level, log));
+  const zel_Status status = host::logOpen(name, moduleID, level, log);
+  if (status == ZEL_OK) access::noteWrite(log, sizeof *log);
+  return call.returns(status);
 }
 
 extern "C" void Tolm_LogCleanup(zel_Log **log) {
   PlatformCall call(Call::Tolm_LogCleanup);
+  access::noteWrite(log, sizeof *log);
   host::logClose(log);
 }
 
@@ -175,11 +193,13 @@ extern "C" void KARST_DeregisterStatusCallback(KarstStatusFn fn, void *data) {
 extern "C" void KARST_GetSelfUUID(zel_UUID *uuid) {
   PlatformCall call(Call::KARST_GetSelfUUID);
   *uuid = directory().self();
+  access::noteWrite(uuid, sizeof *uuid);
   if (Observer *observer = call.machine().observer()) observer->toldSelf(call.fiber(), *uuid);
 }
 
 extern "C" zel_Status KARST_Subscribe(const KarstQuery *query, KarstSubscriptionFn fn, void *data) {
   PlatformCall call(Call::KARST_Subscribe, subjectOf(*query));
+  access::noteRead(query, sizeof *query);
   zel_Status status = call.fault();
   if (status == ZEL_OK)
     status = call.returns(call.machine().callbacks().subscribe(directory(), query, fn, data));
@@ -190,6 +210,7 @@ extern "C" zel_Status KARST_Subscribe(const KarstQuery *query, KarstSubscription
 
 extern "C" void KARST_Unsubscribe(const KarstQuery *query, KarstSubscriptionFn fn, void *data) {
   PlatformCall call(Call::KARST_Unsubscribe, subjectOf(*query));
+  access::noteRead(query, sizeof *query);
   if (Observer *observer = call.machine().observer())
     observer->unsubscribing(call.fiber(), *query, data);
   call.machine().callbacks().unsubscribe(directory(), query, fn, data);
@@ -198,10 +219,13 @@ extern "C" void KARST_Unsubscribe(const KarstQuery *query, KarstSubscriptionFn f
 extern "C" zel_Status KARST_FindEntry(const KarstQuery *query, uint32_t next,
                                       KarstEntryHeader *header, uint32_t size) {
   PlatformCall call(Call::KARST_FindEntry, subjectOf(*query));
+  access::noteRead(query, sizeof *query);
+  if (next == 1) access::noteRead(header, sizeof *header);
   zel_Status status = call.fault();
   if (status == ZEL_OK)
     status = call.returns(size == sizeof *header ? directory().findEntry(*query, next, header)
                                                  : ZEL_BAD_PARAM);
+  if (status == ZEL_OK) access::noteWrite(header, sizeof *header);
   report(call, {Call::KARST_FindEntry, query->type, wantedBy(*query), next, status,
                 status == ZEL_OK ? header : nullptr});
   return status;
@@ -211,8 +235,10 @@ extern "C" zel_Status KARST_FindFullEntryByQuery(const KarstQuery *query, uint32
                                                  const ExprMshAllocator *allocator,
                                                  KarstFullEntry **entry) {
   PlatformCall call(Call::KARST_FindFullEntryByQuery, subjectOf(*query));
+  access::noteRead(query, sizeof *query);
   zel_Status status = call.fault();
   if (status == ZEL_OK) status = call.returns(directory().findFullEntry(*query, *allocator, entry));
+  if (status == ZEL_OK) noteWhole(entry);
   report(call, {Call::KARST_FindFullEntryByQuery, query->type, wantedBy(*query), 0, status,
                 status == ZEL_OK ? &(*entry)->header : nullptr});
   return status;
@@ -222,9 +248,11 @@ extern "C" zel_Status KARST_FindFullEntryByHeader(const KarstEntryHeader *header
                                                   const ExprMshAllocator *allocator, uint32_t,
                                                   KarstFullEntry **entry) {
   PlatformCall call(Call::KARST_FindFullEntryByHeader, Argument::entry(0, header->uuid));
+  access::noteRead(header, sizeof *header);
   zel_Status status = call.fault();
   if (status == ZEL_OK)
     status = call.returns(directory().findFullEntry(*header, *allocator, entry));
+  if (status == ZEL_OK) noteWhole(entry);
   report(call, {Call::KARST_FindFullEntryByHeader, 0, header->uuid, 0, status,
                 status == ZEL_OK ? &(*entry)->header : nullptr});
   return status;

@@ -12,7 +12,9 @@ namespace sim {
  * host's own short sections stay whole. It can still be made to fail. */
 class PlatformCall {
  public:
-  explicit PlatformCall(Call call, const Argument &argument = {});
+  /* `caller`: where the platform function that makes this was called from. */
+  explicit PlatformCall(Call call, const Argument &argument = {},
+                        const void *caller = __builtin_return_address(0));
   ~PlatformCall();
   PlatformCall(const PlatformCall &) = delete;
   PlatformCall &operator=(const PlatformCall &) = delete;

@@ -14,6 +14,7 @@
 #include <utility>
 
 #include "host/kernel/panic.h"
+#include "sim/access/access.h"
 #include "sim/locks.h"
 #include "sim/sanitizers.h"
 
@@ -127,6 +128,7 @@ Fiber &Scheduler::spawn(const std::string &name, std::function<void()> body,
       context::make_fcontext(fiber->stack_->top(), fiber->stack_->size(), &FiberEntry::begin);
   fiber->threadSanitizerFiber_ = sanitizers::makeThread(name.c_str());
   fiber->heldBack_ = heldByName(*fiber);
+  access::begins(*fiber);
   Fiber &made = *fiber;
   fibers_.push_back(std::move(fiber));
   addRunnable(made);
@@ -154,6 +156,7 @@ void Scheduler::runBody() {
 
 void Scheduler::reap(Fiber &fiber) {
   sanitizers::endThread(fiber.threadSanitizerFiber_);
+  access::ends(fiber);
   fiber.stack_->clean();
   freeStacks_.push_back(std::move(fiber.stack_));
   const auto place = std::find_if(fibers_.begin(), fibers_.end(),

@@ -9,6 +9,8 @@
 #include <memory>
 #include <span>
 
+#include "sim/random.h"
+
 namespace sim {
 
 class Fiber;
@@ -36,16 +38,17 @@ class RunOn final : public Strategy {
   size_t pick(size_t count) override;
 };
 
-/* At every step any runnable fiber, each as likely as the others. */
+/* At one step in `every`, by chance, any runnable fiber, each as likely as the others; at the steps
+ * between the fiber that ran last goes on, if it can. */
 class RandomWalk final : public Strategy {
  public:
-  explicit RandomWalk(uint64_t seed) : state_(seed) {}
+  explicit RandomWalk(uint64_t seed, uint32_t every = 1) : random_(seed), every_(every) {}
   Fiber &next(std::span<Fiber *const> runnable, Fiber *current) override;
-  size_t pick(size_t count) override;
+  size_t pick(size_t count) override { return random_.below(count); }
 
  private:
-  uint64_t random(); /* splitmix64 */
-  uint64_t state_;
+  Random random_;
+  uint32_t every_;
 };
 
 }  // namespace sim

@@ -13,6 +13,8 @@
 #include "host/kernel/text.h"
 #include "host/threads/worlds.h"
 #include "platform/tolm.h"
+#include "sim/access/access.h"
+#include "sim/lock_order.h"
 #include "sim/observer.h"
 #include "sim/platform_call.h"
 
@@ -27,8 +29,14 @@ void noteChange(Machine &machine) {
   machine.scheduler().wakeAll(machine.worlds().settled);
 }
 
+void runBody(const World &world, uint32_t (*body)(void *data), void *data) {
+  const Inside inside(Machine::current().scheduler().running(), insideWorld(world.name.text));
+  body(data);
+}
+
 void endWorld(World &world) {
   Machine &machine = Machine::current();
+  access::publish(&world.end);
   world.ended = true;
   machine.scheduler().wakeAll(world.end);
   noteChange(machine);
@@ -41,6 +49,7 @@ World &markStopping(Machine &machine, zel_WorldID id, const Fiber &caller) {
     host::panic("world %u is destroyed, but does not exist or is being destroyed already", id);
   World &world = *found->second;
   if (caller.world == &world) host::panic("world \"%s\" destroys itself", world.name.text);
+  LockOrder::requireOrder(caller, LockOrder::classOf(insideWorld(world.name.text)));
   world.stopping = true;
   machine.scheduler().wakeAll(world.wait);
   return world;
@@ -116,24 +125,32 @@ extern "C" zel_Status TOLM_WorldCreate(zel_WorldID *world, const char *name, zel
   WorldTable &table = call.machine().worlds();
   created->id = ++table.lastID;
   table.worlds.emplace(created->id, created);
+  access::noteAtomicWrite(world, sizeof *world, __ATOMIC_RELEASE);
   std::atomic_ref(*world).store(created->id, std::memory_order_release);
   Fiber &fiber = call.machine().scheduler().spawn(
-      created->name.text, [body, data] { body(data); }, [created] { endWorld(*created); });
+      created->name.text, [body, data, created] { runBody(*created, body, data); },
+      [created] { endWorld(*created); });
+  access::passOn(fiber);
   fiber.world = created;
   return ZEL_OK;
 }
 
 extern "C" void TOLM_WorldDestroy(zel_WorldID *world) {
   const zel_WorldID id = std::atomic_ref(*world).load(std::memory_order_acquire);
+  access::noteAtomicRead(world, sizeof *world, __ATOMIC_ACQUIRE);
   PlatformCall call(Call::TOLM_WorldDestroy, Argument::number(id));
   if (id == ZEL_NO_WORLD) return;
   Machine &machine = call.machine();
   World &ending = markStopping(machine, id, call.fiber());
   while (!ending.ended)
     machine.scheduler().block(ending.end, {.what = "end of world", .object = ending.name.text});
+  access::observe(&ending.end);
   machine.worlds().worlds.erase(id);
+  access::noteAtomicWrite(world, sizeof *world, __ATOMIC_RELEASE);
   std::atomic_ref(*world).store(ZEL_NO_WORLD, std::memory_order_release);
   const zel_HeapID heap = ending.heap;
+  access::forget(&ending.wait);
+  access::forget(&ending.end);
   ending.~World();
   host::heapFree(heap, &ending);
   if (Observer *observer = machine.observer()) observer->worldEnded(call.fiber());
@@ -157,6 +174,8 @@ extern "C" zel_Status zel_WorldWait(uint64_t event, zel_SpinlockHandle lock, uin
     timedOut = !machine.scheduler().block(
         world->wait, {.what = "a wake-up:", .object = reason, .idle = true, .until = until});
   world->reason = nullptr;
+  if (world->woken) access::observe(&world->wait);
+  access::forget(&world->wait); /* the wake-ups are used up */
   world->woken = false;
   noteChange(machine);
   const zel_Status status = world->stopping ? ZEL_WORLD_STOPPING : ZEL_OK;
@@ -169,6 +188,7 @@ extern "C" void zel_WorldForceWakeup(zel_WorldID id) {
   const auto &worlds = call.machine().worlds().worlds;
   const auto found = worlds.find(id);
   if (found == worlds.end()) return;
+  access::publish(&found->second->wait);
   found->second->woken = true;
   call.machine().scheduler().wakeAll(found->second->wait);
 }

@@ -5,10 +5,36 @@
  */
 #include "platform/expr_msh.h"
 #include "platform/tracing.h"
+#include "sim/access/access.h"
 #include "sim/observer.h"
 #include "sim/platform_call.h"
 
 using namespace sim;
+
+/* Decoding has written the fields of the table. A nested one reaches up to the next row's. */
+static void noteFields(const ExprMshField *table, void *record) {
+  auto *bytes = static_cast<uint8_t *>(record);
+  for (const ExprMshField *field = table; field->name; ++field) {
+    size_t size = 0;
+    switch (field->type) {
+      case EXPR_MSH_U64:
+        size = 8;
+        break;
+      case EXPR_MSH_U32:
+        size = 4;
+        break;
+      case EXPR_MSH_ADDRESS:
+        size = 16;
+        break;
+      case EXPR_MSH_MAC:
+        size = 6;
+        break;
+      default:
+        if (field[1].name) size = field[1].offset - field->offset;
+    }
+    access::noteWrite(bytes + field->offset, size);
+  }
+}
 
 extern "C" {
 
@@ -27,10 +53,12 @@ zel_Status ExprMsh_UmshSingleStructure(const ExprMshAllocator *allocator, const 
                                        const void *data, uint32_t length, const char *name,
                                        void *record) {
   PlatformCall call(Call::ExprMsh_UmshSingleStructure, Argument::text(name));
+  access::noteRead(data, length);
   zel_Status status = call.fault();
   if (status == ZEL_OK)
     status = call.returns(
         host_ExprMsh_UmshSingleStructure(allocator, table, data, length, name, record));
+  noteFields(table, record);
   if (Observer *observer = call.machine().observer())
     observer->decoded(call.fiber(), name, status, record);
   return status;
@@ -63,17 +91,21 @@ void Trace_Notify(uint64_t handle) {
 
 void TokenBucket_InitMini(TokenBucketMini *bucket, const void *config) {
   PlatformCall call(Call::TokenBucket_InitMini);
+  access::noteWrite(bucket, sizeof *bucket);
   host_TokenBucket_InitMini(bucket, config);
 }
 
 bool TokenBucket_UseTokensMini(TokenBucketMini *bucket, const void *config, uint64_t tokens,
                                uint64_t *out) {
   PlatformCall call(Call::TokenBucket_UseTokensMini, Argument::number(tokens));
+  access::noteAtomicUpdate(bucket->opaque, sizeof bucket->opaque[0], __ATOMIC_RELAXED);
+  access::noteWrite(out, sizeof *out);
   return call.returns(host_TokenBucket_UseTokensMini(bucket, config, tokens, out));
 }
 
 bool TokenBucket_UseTokens(TokenBucket *bucket, uint64_t tokens, uint64_t *out) {
   PlatformCall call(Call::TokenBucket_UseTokens, Argument::number(tokens));
+  access::noteWrite(out, sizeof *out);
   return call.returns(host_TokenBucket_UseTokens(bucket, tokens, out));
 }
 

@@ -34,17 +34,25 @@ struct alignas(kAlignment) BlockHeader {
   void *block() { return this + 1; }
 };
 
+class Malloc final : public HeapMemory {
+ public:
+  /* Exactly what was asked, not what is accounted: a sanitizer then sees the first byte beyond. */
+  void *get(size_t front, size_t size) override { return std::malloc(front + size); }
+  void put(void *memory) override { std::free(memory); }
+};
+
 class Heap {
  public:
-  explicit Heap(const zel_HeapProps &props)
-      : name_(toString(props.name)),
+  Heap(const zel_HeapProps &props, HeapMemory &memory)
+      : memory_(memory),
+        name_(toString(props.name)),
         maximum_(props.maximumSize),
         buckets_(bucketsFor(props.maximumSize)) {}
 
   ~Heap() {
     while (oldest_ != nullptr) {
       BlockHeader *const next = oldest_->newer;
-      std::free(oldest_);
+      memory_.put(oldest_);
       oldest_ = next;
     }
   }
@@ -54,9 +62,7 @@ class Heap {
   void *allocate(uint32_t size, void *returnAddress) {
     const uint32_t space = heapSpaceFor(size);
     if (space > maximum_ - used_) return nullptr;
-    /* Exactly what was asked, not what is accounted: a sanitizer then sees the first byte beyond.
-     */
-    void *memory = std::malloc(sizeof(BlockHeader) + size);
+    void *memory = memory_.get(sizeof(BlockHeader), size);
     if (memory == nullptr) return nullptr;
 
     auto *header = new (memory) BlockHeader{newest_, nullptr, nullptr, returnAddress, size};
@@ -72,18 +78,20 @@ class Heap {
     return header->block();
   }
 
-  bool release(void *block) {
+  HeapMemory &memory() const { return memory_; }
+
+  /* Forgets the block; what is left is to put its memory back. Null when it is not alive. */
+  void *release(void *block) {
     BlockHeader **place = &bucketOf(block);
     while (*place != nullptr && (*place)->block() != block) place = &(*place)->nextInBucket;
     BlockHeader *const header = *place;
-    if (header == nullptr) return false;
+    if (header == nullptr) return nullptr;
 
     *place = header->nextInBucket;
     (header->older == nullptr ? oldest_ : header->older->newer) = header->newer;
     (header->newer == nullptr ? newest_ : header->newer->older) = header->older;
     used_ -= heapSpaceFor(header->size);
-    std::free(header);
-    return true;
+    return header;
   }
 
   HeapState state() const {
@@ -105,6 +113,7 @@ class Heap {
     return buckets_[(address ^ address >> 16) & (buckets_.size() - 1)];
   }
 
+  HeapMemory &memory_;
   const std::string name_;
   const uint32_t maximum_;
   uint32_t used_ = 0;
@@ -116,6 +125,7 @@ class Heap {
 };
 
 std::mutex heapsLock;
+HeapMemory *heapMemory = nullptr;    /* of heaps to come; null: malloc */
 zel_HeapID lastHeapID = ZEL_NO_HEAP; /* IDs are never used twice: a stale one is recognised */
 
 std::unordered_map<zel_HeapID, std::unique_ptr<Heap>> &heaps() {
@@ -126,6 +136,11 @@ std::unordered_map<zel_HeapID, std::unique_ptr<Heap>> &heaps() {
 Heap *findHeapLocked(zel_HeapID id) {
   const auto found = heaps().find(id);
   return found == heaps().end() ? nullptr : found->second.get();
+}
+
+HeapMemory &memoryLocked() {
+  static Malloc ordinary;
+  return heapMemory == nullptr ? ordinary : *heapMemory;
 }
 
 [[noreturn]] void panicNoHeap(const char *what, zel_HeapID id) {
@@ -153,11 +168,16 @@ uint32_t heapSpaceFor(uint32_t bytes) {
   return static_cast<uint32_t>(std::min<uint64_t>(space, std::numeric_limits<uint32_t>::max()));
 }
 
+void setHeapMemory(HeapMemory *memory) {
+  const std::lock_guard guard(heapsLock);
+  heapMemory = memory;
+}
+
 zel_Status heapCreate(const zel_HeapProps &props, zel_HeapID *heap) {
   if (props.maximumSize == 0 || props.initialSize > props.maximumSize) return ZEL_BAD_PARAM;
   try {
-    auto created = std::make_unique<Heap>(props);
     const std::lock_guard guard(heapsLock);
+    auto created = std::make_unique<Heap>(props, memoryLocked());
     const zel_HeapID id = lastHeapID + 1;
     heaps().emplace(id, std::move(created));
     lastHeapID = id;
@@ -193,11 +213,16 @@ void *heapAlloc(zel_HeapID heap, uint32_t size, void *returnAddress) {
 
 void heapFree(zel_HeapID heap, void *block) {
   if (block == nullptr) return;
+  HeapMemory *origin = nullptr;
+  void *memory = nullptr;
   {
     const std::lock_guard guard(heapsLock);
-    Heap *const found = findHeapLocked(heap);
-    if (found != nullptr && found->release(block)) return;
+    if (Heap *const found = findHeapLocked(heap)) {
+      origin = &found->memory();
+      memory = found->release(block);
+    }
   }
+  if (memory != nullptr) return origin->put(memory);
   panic("freeing %p, which is not alive in heap 0x%" PRIx64, block, heap);
 }
 

@@ -13,6 +13,25 @@ namespace host {
 /* What one request of `bytes` takes from a heap's maximum: the block rounded up and its header. */
 uint32_t heapSpaceFor(uint32_t bytes);
 
+/* Where the memory of blocks comes from. */
+class HeapMemory {
+ public:
+  HeapMemory() = default;
+  virtual ~HeapMemory() = default;
+  HeapMemory(const HeapMemory &) = delete;
+  HeapMemory &operator=(const HeapMemory &) = delete;
+
+  /* `front` bytes for the heap's own record and `size` for the block behind it, aligned to 16; null
+   * when there are no more. Called under the heaps' lock: must not sleep, log or panic. */
+  virtual void *get(size_t front, size_t size) = 0;
+
+  /* Takes back what get() gave. Called without the lock. */
+  virtual void put(void *memory) = 0;
+};
+
+/* Serves the heaps that are created from now on, and must outlive them. Null: malloc and free. */
+void setHeapMemory(HeapMemory *memory);
+
 zel_Status heapCreate(const zel_HeapProps &props, zel_HeapID *heap);
 void heapDestroy(zel_HeapID heap); /* reports what is alive, through the log */
 void *heapAlloc(zel_HeapID heap, uint32_t size, void *returnAddress);

@@ -1,0 +1,520 @@
+/* The host, its actors' operations and what must hold; see cluster.h. */
+#include "tests/scenarios/cluster.h"
+
+#include <algorithm>
+#include <cstring>
+#include <utility>
+
+#include "host/directory/records.h"
+#include "host/kernel/log.h"
+#include "host/kernel/panic.h"
+#include "host/tracing/tracing.h"
+#include "sim/lock_order.h"
+#include "tests/directory_view.h"
+#include "tests/scenarios/actions.h"
+#include "tests/scenarios/guards.h"
+#include "tests/uuids.h"
+
+namespace {
+
+constexpr uint32_t nudgeNode = 200; /* comes and goes to wake the world; no scenario uses it */
+constexpr uint32_t firstOfFlood = 1000;
+constexpr uint8_t canary = 0xa5;
+
+/* Trace ids that are counted; the numbers are part of the record's format. */
+enum TraceID {
+  CreateInstance = 1,
+  DestroyInstance = 2,
+  UpdateAddresses = 6,
+  InvokeCallback = 7,
+  AddNetIf = 8,
+  RemoveNetIf = 9,
+  AddNode = 12,
+  RemoveNode = 13,
+  RescanNetIfs = 15,
+  RescanNodes = 16,
+  SetCallback = 17,
+  ReleaseInstance = 18,
+};
+
+/* The host reports, and does not mind, what a heap or a lock domain still holds at its end. */
+void leftBehind(const std::string &report) {
+  host::panic("left behind: %s", report.c_str());
+}
+
+}  // namespace
+
+std::string textOf(const sim::Operation &operation) {
+  static const char *const texts[] = {
+#define SCENARIO_TEXT(name, text) text,
+      SCENARIO_ACTIONS(SCENARIO_TEXT)
+#undef SCENARIO_TEXT
+  };
+  const std::string_view pattern = texts[operation.kind % actionCount];
+  const unsigned values[] = {operation.a, operation.b, operation.c};
+  std::string text;
+  for (size_t i = 0; i < pattern.size(); i++) {
+    if (pattern[i] == '$') {
+      text += std::to_string(values[pattern[++i] - '1']);
+    } else {
+      text += pattern[i];
+    }
+  }
+  return text;
+}
+
+/* ---- Life ------------------------------------------------------------------------------------ */
+
+Cluster::Cluster(const sim::Settings &settings, std::filesystem::path module, unsigned callbackWork)
+    : simulation_(settings),
+      lockstep_(simulation_),
+      path_(std::move(module)),
+      callbackWork_(callbackWork) {
+  host::setLogSink(
+      [](const host::LogLine &line) {
+        if (line.text.find("still") != std::string::npos) leftBehind(line.text);
+      },
+      true);
+  simulation_.setObserver(&lockstep_);
+  simulation_.directory().setSelf(nodeUUID(1));
+}
+
+Cluster::~Cluster() {
+  simulation_.setObserver(nullptr);
+  host::setLogSink(nullptr, false);
+}
+
+void Cluster::load() {
+  if (module_ || loading_ || unloading_) return;
+  loading_ = true;
+  gone_.take();
+  lockstep_.moduleComesOrGoes();
+  host::Module *module = nullptr;
+  try {
+    module = &simulation_.modules().load(path_);
+  } catch (const host::ModuleError &) {
+    /* A platform call was made to fail; another load may succeed. */
+  }
+  loading_ = false;
+  if (!module) {
+    if (simulation_.faultsInjected() == 0) host::panic("a load fails for no reason");
+    gone_.give();
+    return lockstep_.moduleIsGone();
+  }
+  declareVariableGuards(simulation_, *module);
+  lockstep_.moduleIsThere();
+  functions_.create = module->function<decltype(KARSTResolver_Create)>("KARSTResolver_Create");
+  functions_.destroy = module->function<decltype(KARSTResolver_Destroy)>("KARSTResolver_Destroy");
+  functions_.setCallback =
+      module->function<decltype(KARSTResolver_SetCallback)>("KARSTResolver_SetCallback");
+  functions_.getNodeLocators =
+      module->function<decltype(KARSTResolver_GetNodeLocators)>("KARSTResolver_GetNodeLocators");
+  loaded_.give();
+  module_ = module;
+}
+
+/* Clients make no new instances any more; those that they have, they destroy while it lasts. */
+void Cluster::unload() {
+  if (!module_ || unloading_) return;
+  unloading_ = true;
+  while (creating_ > 0) simulation_.scheduler().sleep(1'000);
+  simulation_.spawn("closing", [this] { destroyAll(); });
+  loaded_.take();
+  used_.take();
+  lockstep_.moduleComesOrGoes();
+  simulation_.modules().unload(*module_);
+  lockstep_.moduleIsGone();
+  withdrawGuards(simulation_);
+  gone_.give();
+  if (simulation_.callbacks().subscriptions() != 0 || simulation_.callbacks().registrations() != 0)
+    host::panic("unloaded, and the directory still knows the module");
+  requireTraces();
+  module_ = nullptr;
+  unloading_ = false;
+}
+
+void Cluster::close() {
+  simulation_.clearFaults();
+  simulation_.spawn("unloader", [this] {
+    if (module_ && !unloading_) {
+      unload();
+    }
+  });
+  simulation_.run();
+  if (module_) host::panic("the module is still there");
+}
+
+/* ---- Operations ------------------------------------------------------------------------------ */
+
+void Cluster::perform(const sim::Operation &operation) {
+  const auto [phase, actor, kind, a, b, c] = operation;
+  host::Directory &directory = simulation_.directory();
+  ++performed_;
+  simulation_.note("operation:", sim::Argument::text(textOf(operation).c_str()));
+  switch (static_cast<Action>(kind % actionCount)) {
+    case Action::PutNode:
+      return putNode(a, b);
+    case Action::RemoveNode:
+      return directory.remove(KARST_TYPE_NODE, nodeUUID(a));
+    case Action::PutNetIf:
+      return putNetIf(a, b, c);
+    case Action::RemoveNetIf:
+      return directory.remove(KARST_TYPE_NET_INTERFACE, netIfUUID(a));
+    case Action::PutHealth:
+      return putHealth(a, b);
+    case Action::RemoveHealth:
+      return directory.remove(KARST_TYPE_HEALTH_STATUS, netIfUUID(a));
+    case Action::PutObject:
+      return directory.put({objectType, objectUUID(a), b == 0 ? noUUID : nodeUUID(b), {0xa0}});
+    case Action::RemoveObject:
+      return directory.remove(objectType, objectUUID(a));
+    case Action::Garble:
+      return garble(a, b);
+    case Action::Resync:
+      return directory.resync();
+    case Action::Usable:
+    case Action::Unusable:
+      usable_ = static_cast<Action>(kind % actionCount) == Action::Usable;
+      return directory.setUsable(usable_);
+    case Action::Interrupt:
+      directory.setUsable(false);
+      usable_ = true;
+      return directory.setUsable(true);
+    case Action::Flood:
+      return flood(a, b, true);
+    case Action::Drain:
+      return flood(a, b, false);
+    case Action::Create:
+      return create(a, b, c);
+    case Action::SetCallback:
+      if (Client *client = slot(a)) setCallback(*client, b);
+      return;
+    case Action::Read:
+      if (Client *client = slot(a)) read(*client);
+      return;
+    case Action::Destroy:
+      return destroy(a % clients);
+    case Action::Load:
+      return load();
+    case Action::Unload:
+      return unload();
+    case Action::Pause:
+      return simulation_.scheduler().sleep((a + 1ull) * 100'000);
+    case Action::Preempt:
+      return simulation_.forcePreemption(a);
+  }
+}
+
+/* ---- The directory --------------------------------------------------------------------------- */
+
+/* Flag 4: an entry that is there is changed in place, else it goes first. */
+void Cluster::putNode(uint32_t node, uint32_t flags) {
+  if (!(flags & 4)) simulation_.directory().remove(KARST_TYPE_NODE, nodeUUID(node));
+  const KarstNodeEntry record{++stamp_, node, flags % 4, 1, 2};
+  simulation_.directory().put(
+      {KARST_TYPE_NODE, nodeUUID(node), nodeUUID(node), host::encode(record)});
+}
+
+/* What the record holds: 0 to 7 addresses, every second one IPv6; a traffic mask; the type. */
+void Cluster::putNetIf(uint32_t netIf, uint32_t node, uint32_t record) {
+  KarstNetInterfaceEntry entry{};
+  entry.networkType = record % 16 == 15 ? 2 : KARST_NETWORK_TYPE_IP;
+  entry.numIpAddresses = record % 8;
+  entry.trafficTypeMask = record / 16 % 4;
+  entry.bandwidth = record / 64;
+  const uint8_t address[16] = {static_cast<uint8_t>(10 + record % 16), static_cast<uint8_t>(node),
+                               static_cast<uint8_t>(netIf), static_cast<uint8_t>(record), 6};
+  if (entry.networkType == KARST_NETWORK_TYPE_IP && record % 16 != 8)
+    std::memcpy(entry.ipv4Address, address, sizeof entry.ipv4Address);
+  for (uint32_t i = 0; i < entry.numIpAddresses; i++) {
+    entry.ipAddresses[i].isIPv6 = i % 2;
+    std::memcpy(entry.ipAddresses[i].address, address, i % 2 ? 16 : 4);
+    entry.ipAddresses[i].address[2] = static_cast<uint8_t>(netIf + i);
+  }
+  simulation_.directory().put(
+      {KARST_TYPE_NET_INTERFACE, netIfUUID(netIf), nodeUUID(node), host::encode(entry)});
+}
+
+void Cluster::putHealth(uint32_t netIf, uint32_t flags) {
+  KarstHealthStatusEntry entry{};
+  entry.healthFlags = flags % 3;
+  entry.timestamp = ++stamp_;
+  simulation_.directory().put(
+      {KARST_TYPE_HEALTH_STATUS, netIfUUID(netIf), noUUID, host::encode(entry)});
+}
+
+/* Bytes that no reader can make sense of, below an owner that may be there or not. */
+void Cluster::garble(uint32_t which, uint32_t kind) {
+  const uint8_t types[] = {KARST_TYPE_NODE, KARST_TYPE_NET_INTERFACE, KARST_TYPE_HEALTH_STATUS};
+  const uint8_t type = types[kind % 3];
+  const zel_UUID uuid = type == KARST_TYPE_NODE ? nodeUUID(which) : netIfUUID(which);
+  simulation_.directory().put(
+      {type, uuid, nodeUUID(1 + which % 3), {0x9f, static_cast<uint8_t>(++stamp_)}});
+}
+
+/* Nodes with eight interfaces each. */
+void Cluster::flood(uint32_t groups, uint32_t from, bool put) {
+  for (uint32_t node = firstOfFlood + from; node < firstOfFlood + from + groups; node++) {
+    for (uint32_t i = node * 8; i < node * 8 + 8; i++) {
+      if (put) {
+        putNetIf(i, node, 1);
+      } else {
+        simulation_.directory().remove(KARST_TYPE_NET_INTERFACE, netIfUUID(i));
+      }
+    }
+    if (put) {
+      putNode(node, 0);
+    } else {
+      simulation_.directory().remove(KARST_TYPE_NODE, nodeUUID(node));
+    }
+  }
+}
+
+/* ---- Clients --------------------------------------------------------------------------------- */
+
+/* Targets 0 to 7 are nodes, the others objects; of the options bit 0 gives an object a hint, bit 1
+ * asks for the local locator. */
+void Cluster::create(uint8_t number, uint8_t target, uint8_t options) {
+  const size_t place = number % clients;
+  if (slots_[place] || !module_ || unloading_) return;
+  const bool object = target >= 8;
+  const zel_UUID objectWanted = object ? objectUUID(target % 8u) : noUUID;
+  const zel_UUID nodeWanted =
+      object ? (options & 1 ? nodeUUID(1 + options / 4 % 4u) : noUUID) : nodeUUID(target);
+  const bool local = (options & 2) != 0;
+
+  ++creating_;
+  Client &client = *all_.emplace_back(std::make_unique<Client>());
+  client.cluster = this;
+  client.work = callbackWork_;
+  client.model = &lockstep_.creating(objectWanted, nodeWanted, local);
+  slots_[place] = &client; /* taken, though nobody can use it yet */
+  client.users = 1;
+  loaded_.take();
+  const zel_Status status =
+      functions_.create(&client.instance, objectType, objectWanted, nodeWanted, local);
+  lockstep_.created(status);
+  client.made.give();
+  used_.give();
+  client.users = 0;
+  if (status != ZEL_OK) {
+    if (client.instance) host::panic("create fails with 0x%x and leaves an instance", status);
+    client.destroyed = true;
+    slots_[place] = nullptr;
+  }
+  --creating_;
+}
+
+/* Around a call with an instance; as long as somebody is inside, nobody destroys it. */
+void Cluster::enter(Client &client) {
+  ++client.users;
+  client.made.take();
+}
+
+void Cluster::leave(Client &client) {
+  client.used.give();
+  used_.give();
+  --client.users;
+}
+
+void Cluster::callback(void *data, KARSTResolverInstance *instance, uint32_t state) {
+  auto *client = static_cast<Client *>(data);
+  client->cluster->told(*client, instance, state);
+}
+
+void Cluster::told(Client &client, KARSTResolverInstance *instance,
+                   uint32_t state) KARST_UNCHECKED {
+  sim::Fiber &fiber = simulation_.scheduler().running();
+  const sim::Inside inside(fiber, sim::insideClientCallback);
+  if (client.destroyed) host::panic("a callback of an instance whose destroy has returned");
+  if (instance != client.instance) host::panic("a callback with somebody else's data");
+  if (fiber.heldCount != 1 || std::strcmp(fiber.held[0]->name.text, "KARSTResolverInstance") != 0)
+    host::panic("a callback with other locks than its instance's");
+  const model::Answer answer = model::Answer::of(state, instance->locators);
+  client.lastTold = lockstep_.saw(*client.model, client.lastTold, answer);
+  if (state == KARST_RESOLVER_STATE_RESOLVED && !client.model->local) {
+    if (answer.major < client.lastMajor) host::panic("an older version is told after a newer one");
+    client.lastMajor = answer.major;
+  }
+  client.told = true;
+  ++client.callbacks;
+  ++callbacks_;
+  for (unsigned i = 0; i < client.work; i++) simulation_.scheduler().point();
+}
+
+void Cluster::setCallback(Client &client, uint8_t kind) {
+  if (!client.instance || client.users > 0) return; /* one at a time sets callbacks */
+  enter(client);
+  const bool install = kind % 4 != 0;
+  const uint64_t before = client.callbacks;
+  ++callbackCalls_;
+  client.work = kind % 4 == 3 ? callbackWork_ * 8 : callbackWork_;
+  functions_.setCallback(client.instance, install ? &callback : nullptr, &client);
+  if (install && client.callbacks == before) host::panic("a new callback was not called at once");
+  client.hasCallback = install;
+  leave(client);
+}
+
+void Cluster::read(Client &client) {
+  if (!client.instance) return;
+  enter(client);
+  KARSTResolverNodeLocators set;
+  std::memset(&set, canary, sizeof set);
+  set.capacity = KARST_RESOLVER_MAX_LOCATORS;
+  const size_t from = client.model->answers.size() - 1;
+  const zel_Status status = functions_.getNodeLocators(client.instance, &set);
+  if (status == ZEL_OK) {
+    lockstep_.saw(*client.model, from, model::Answer::of(KARST_RESOLVER_STATE_RESOLVED, set));
+  } else {
+    if (status != ZEL_NOT_FOUND || reinterpret_cast<const uint8_t *>(&set)[0] != canary)
+      host::panic("a read that finds nothing returns 0x%x or writes", status);
+    model::Answer none;
+    none.state = KARST_RESOLVER_STATE_UNRESOLVED;
+    lockstep_.saw(*client.model, from, none);
+  }
+  leave(client);
+}
+
+void Cluster::destroy(size_t place) {
+  Client *client = slots_[place];
+  if (!client || !client->instance || client->users > 0) return;
+  KARSTResolverInstance *instance = client->instance;
+  slots_[place] = nullptr; /* from here on nobody else uses it; its callback may still run */
+  client->made.take();
+  client->used.take();
+  lockstep_.destroying(*client->model);
+  functions_.destroy(instance);
+  client->destroyed = true;
+  lockstep_.destroyed();
+  used_.give();
+}
+
+void Cluster::destroyAll() {
+  for (size_t place = 0; place < clients; place++) {
+    while (slots_[place]) {
+      destroy(place);
+      if (slots_[place]) simulation_.scheduler().sleep(1'000);
+    }
+  }
+}
+
+/* ---- At rest --------------------------------------------------------------------------------- */
+
+void Cluster::recover() {
+  simulation_.clearFaults();
+  host::Directory &directory = simulation_.directory();
+  if (usable_) {
+    directory.setUsable(false); /* an enable may have failed */
+    directory.setUsable(true);
+  }
+  simulation_.run();
+  resync();
+  putNode(nudgeNode, 0);
+  simulation_.run();
+  directory.remove(KARST_TYPE_NODE, nodeUUID(nudgeNode));
+  simulation_.run();
+  faultsSeen_ = simulation_.faultsInjected();
+}
+
+void Cluster::resync() {
+  simulation_.directory().resync();
+  simulation_.run();
+}
+
+void Cluster::rest() {
+  simulation_.run();
+  requireQuiet();
+  if (simulation_.faultsInjected() != faultsSeen_) {
+    recover();
+    requireQuiet();
+  }
+  if (!module_) return;
+  if (lockstep_.resolver().refused) resync(); /* what found no slot then may find one now */
+  touchNews();
+  requireQuiet();
+  requireDirectoryTaken();
+}
+
+/* A new version alone reaches no instance before its node's next change. Here that comes, in two
+ * steps, since a queue that overflows takes an entry's going and coming for nothing. */
+void Cluster::touchNews() {
+  host::Directory &directory = simulation_.directory();
+  std::vector<host::Entry> touched;
+  for (const auto &[uuid, node] : lockstep_.resolver().nodes)
+    if (const auto entry = directory.entry(KARST_TYPE_NODE, uuid); entry && node->news)
+      touched.push_back(*entry);
+  for (const host::Entry &entry : touched) directory.remove(entry.type, entry.uuid);
+  simulation_.run();
+  for (const host::Entry &entry : touched) directory.put(entry);
+  simulation_.run();
+}
+
+void Cluster::requireQuiet() {
+  lockstep_.atRest();
+  if (!module_) return;
+  requireClientsTold();
+  requireTraces();
+}
+
+void Cluster::requireClientsTold() {
+  for (const Client *client : slots_) {
+    if (!client || !client->hasCallback) continue;
+    if (client->model->answers[client->lastTold] != client->model->answers.back())
+      host::panic("a client was told \"%s\" last, and reads \"%s\"",
+                  client->model->answers[client->lastTold].text().c_str(),
+                  client->model->answers.back().text().c_str());
+  }
+}
+
+/* The module holds what the directory says, as far as it fits. */
+void Cluster::requireDirectoryTaken() {
+  host::Directory &directory = simulation_.directory();
+  if (!usable_ || !lockstep_.resolver().enabled) return;
+  if (directory.entries(KARST_TYPE_NODE).size() > 64 ||
+      directory.entries(KARST_TYPE_NET_INTERFACE).size() > 400)
+    return;
+  std::vector<HeldInstance> held;
+  for (const Client *client : slots_) {
+    if (!client) continue;
+    HeldInstance one{client->instance, std::nullopt};
+    if (client->hasCallback) one.told = client->model->answers[client->lastTold].state;
+    held.push_back(one);
+  }
+  const DirectoryView view = viewOf(directory, nodeUUID(1), simulation_.settings().witness, held);
+  const std::vector<std::string> differences = differencesOf(lockstep_.cache(), view);
+  if (differences.empty()) return;
+  std::string text;
+  for (const std::string &line : differences) text += "\n  " + line;
+  host::panic("the module and the directory differ:%s", text.c_str());
+}
+
+/* Each kind of event, counted from the start, agrees with what has happened. */
+void Cluster::requireTraces() {
+  for (const host::TracedRecord &record : host::readTrace()) {
+    if (record.sequence < traceSeen_) continue;
+    if (record.sequence != traceSeen_) host::panic("the trace ring is too small for this run");
+    ++traceSeen_;
+    ++traced_[record.id % std::size(traced_)];
+    if (record.id == ReleaseInstance && record.payload[1] == 1) ++freedInstances_;
+  }
+  const auto require = [&](const char *what, uint64_t counted, uint64_t wanted) {
+    if (counted != wanted)
+      host::panic("the trace counts %llu %s, and there were %llu",
+                  static_cast<unsigned long long>(counted), what,
+                  static_cast<unsigned long long>(wanted));
+  };
+  const Lockstep::Counts &counts = lockstep_.counts();
+  const bool there = lockstep_.cache() != nullptr;
+  require("nodes", traced_[AddNode] - traced_[RemoveNode],
+          there ? lockstep_.resolver().nodes.size() : 0);
+  require("interfaces", traced_[AddNetIf] - traced_[RemoveNetIf],
+          there ? lockstep_.resolver().netIfs.size() : 0);
+  require("created instances", traced_[CreateInstance], counts.creates);
+  require("destroyed instances", traced_[DestroyInstance], counts.destroys);
+  require("instances", traced_[CreateInstance] - freedInstances_, counts.creates - counts.destroys);
+  require("answers", traced_[UpdateAddresses], counts.answers);
+  require("callbacks", traced_[InvokeCallback], callbacks_);
+  require("callbacks set", traced_[SetCallback], callbackCalls_);
+  require("rescans of nodes", traced_[RescanNodes], counts.nodeRescans);
+  require("rescans of interfaces", traced_[RescanNetIfs], counts.netIfRescans);
+}

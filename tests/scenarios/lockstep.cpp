@@ -1,0 +1,550 @@
+/* The model beside the module; see lockstep.h. Every member of the module that is read here is read
+ * where its lock is held or nothing runs, which the analysis cannot see.
+ */
+#include "tests/scenarios/lockstep.h"
+
+#include <algorithm>
+#include <cstring>
+
+#include "host/kernel/panic.h"
+#include "host/kernel/uuid.h"
+#include "tests/scenarios/guards.h"
+
+namespace {
+
+constexpr const char *cacheLockName = "KARSTResolverCache";
+
+bool isCacheLock(const sim::Spinlock &lock) {
+  return std::strcmp(lock.name.text, cacheLockName) == 0;
+}
+
+uint8_t typeOf(const char *record) {
+  if (std::strcmp(record, "KarstNodeEntry") == 0) return KARST_TYPE_NODE;
+  if (std::strcmp(record, "KarstNetInterfaceEntry") == 0) return KARST_TYPE_NET_INTERFACE;
+  return KARST_TYPE_HEALTH_STATUS;
+}
+
+size_t sizeOf(uint8_t type) {
+  if (type == KARST_TYPE_NODE) return sizeof(KarstNodeEntry);
+  if (type == KARST_TYPE_NET_INTERFACE) return sizeof(KarstNetInterfaceEntry);
+  return sizeof(KarstHealthStatusEntry);
+}
+
+std::string name(const zel_UUID &uuid) {
+  return host::toString(uuid);
+}
+
+/* "<what> of <whose> is <real> and should be <wanted>" */
+template <typename Value>
+void require(Value real, Value wanted, const char *what, const zel_UUID &whose) {
+  if (real == wanted) return;
+  host::panic("lockstep: %s of %s is %lld, and should be %lld", what, name(whose).c_str(),
+              static_cast<long long>(real), static_cast<long long>(wanted));
+}
+
+void requireSections(unsigned sections, unsigned wanted) {
+  if (sections == wanted) return;
+  host::panic("lockstep: a callback has passed through %u critical sections, not %u", sections,
+              wanted);
+}
+
+size_t lengthOf(const KARSTResolverLink &head) {
+  size_t length = 0;
+  for (const KARSTResolverLink *link = head.next; link != &head; link = link->next) ++length;
+  return length;
+}
+
+}  // namespace
+
+Lockstep::Lockstep(sim::Simulation &simulation) : simulation_(simulation) {}
+
+/* ---- Life ------------------------------------------------------------------------------------ */
+
+void Lockstep::statusRegistered(sim::Fiber &, void *data, zel_Status status) {
+  if (status != ZEL_OK) return;
+  model_ = std::make_unique<model::Resolver>(simulation_.settings().witness);
+  cache_ = static_cast<KARSTResolverCache *>(data);
+  declareCacheGuards(simulation_, *cache_);
+}
+
+void Lockstep::moduleComesOrGoes() {
+  begin(simulation_.scheduler().running(), Activity::Disable);
+}
+
+void Lockstep::moduleIsGone() {
+  activities_.clear();
+  cache_ = nullptr;
+  for (const Known &known : instances_)
+    if (known.alive) host::panic("lockstep: the module is gone, and an instance is not");
+  if (model_ && (!model_->nodes.empty() || !model_->slots.empty() || cacheSubscriptions_ != 0))
+    host::panic(
+        "lockstep: the module is gone, and %zu nodes, %zu interfaces, %zu subscriptions not",
+        model_->nodes.size(), model_->slots.size(), cacheSubscriptions_);
+  model_.reset();
+}
+
+void Lockstep::moduleIsThere() {
+  activities_.erase(simulation_.scheduler().running().id());
+}
+
+/* ---- What fibers do -------------------------------------------------------------------------- */
+
+Lockstep::Activity &Lockstep::begin(const sim::Fiber &fiber, Activity::Kind kind) {
+  Activity &activity = activities_[fiber.id()];
+  activity = Activity{};
+  activity.kind = kind;
+  return activity;
+}
+
+Lockstep::Activity *Lockstep::of(const sim::Fiber &fiber) {
+  const auto found = activities_.find(fiber.id());
+  if (found != activities_.end()) return &found->second;
+  return fiber.world ? &begin(fiber, Activity::World) : nullptr;
+}
+
+void Lockstep::subscriptionCalls(sim::Fiber &fiber, const sim::SubscriptionCall &call) {
+  const Activity::Kind kind = call.type == KARST_TYPE_NODE            ? Activity::Nodes
+                              : call.type == KARST_TYPE_NET_INTERFACE ? Activity::NetIfs
+                              : call.type == KARST_TYPE_HEALTH_STATUS ? Activity::Health
+                                                                      : Activity::Object;
+  Activity &activity = begin(fiber, kind);
+  activity.header = *call.header;
+  activity.status = call.status;
+  activity.data = call.data;
+  const bool rescan = call.status == ZEL_SUB_RESYNC || call.status == ZEL_SUB_OVERFLOW;
+  if (kind == Activity::Nodes && rescan) ++counts_.nodeRescans;
+  if (kind == Activity::NetIfs && rescan) ++counts_.netIfRescans;
+  if (kind != Activity::Object || call.status == ZEL_SUB_CANCELLED) return;
+  activity.instance = &instanceOf(call.data);
+  if (call.status == ZEL_OK) {
+    activity.found = true;
+    want(activity, call.header->owner);
+  }
+}
+
+void Lockstep::subscriptionReturned(sim::Fiber &fiber, const sim::SubscriptionCall &call) {
+  Activity &activity = activities_[fiber.id()];
+  const bool cancelled = call.status == ZEL_SUB_CANCELLED;
+  switch (activity.kind) {
+    case Activity::Nodes:
+    case Activity::NetIfs:
+      if (cancelled) --cacheSubscriptions_;
+      requireSections(activity.sections, cancelled ? 0 : 1);
+      break;
+    case Activity::Health:
+      requireSections(activity.sections, 1);
+      break;
+    default:
+      if (!cancelled) objectReturned(activity);
+  }
+  activities_.erase(fiber.id());
+}
+
+void Lockstep::statusCalls(sim::Fiber &fiber, uint32_t status) {
+  begin(fiber, status & KARST_STATUS_USABLE ? Activity::Enable : Activity::Disable);
+}
+
+void Lockstep::statusReturned(sim::Fiber &fiber, uint32_t) {
+  const Activity &activity = activities_[fiber.id()];
+  const bool enabling = activity.kind == Activity::Enable && !activity.failed;
+  if (enabling ? activity.sections != 2 : activity.disabling == 1)
+    host::panic("lockstep: a status call has ended half-way");
+  activities_.erase(fiber.id());
+}
+
+model::Instance &Lockstep::creating(const zel_UUID &object, const zel_UUID &node, bool local) {
+  Known &known = instances_.emplace_back();
+  known.instance = std::make_unique<model::Instance>();
+  model::Instance &instance = *known.instance;
+  instance.object = object;
+  instance.local = local;
+  Activity &activity = begin(simulation_.scheduler().running(), Activity::Create);
+  activity.instance = &instance;
+  if (host::isZero(object)) {
+    activity.wanted = node;
+  } else {
+    instance.hint = node;
+    instance.useHint = !host::isZero(node);
+  }
+  return instance;
+}
+
+void Lockstep::created(zel_Status status) {
+  Activity &activity = activities_[simulation_.scheduler().running().id()];
+  model::Instance &instance = *activity.instance;
+  const bool resolved = std::any_of(
+      instance.answers.begin(), instance.answers.end(),
+      [](const model::Answer &one) { return one.state == KARST_RESOLVER_STATE_RESOLVED; });
+  const bool good = status == ZEL_OK ? resolved && !instance.destroyed && !activity.failed
+                                     : instance.destroyed || activity.sections == 0;
+  if (!good)
+    host::panic("lockstep: create returned 0x%x after %u sections, resolved %d, destroyed %d",
+                status, activity.sections, resolved, instance.destroyed);
+  if (activity.sections > 0) ++counts_.creates;
+  if (status != ZEL_OK) {
+    if (activity.sections > 0) ++counts_.destroys;
+    for (Known &known : instances_)
+      if (known.instance.get() == &instance) known.alive = false;
+  }
+  activities_.erase(simulation_.scheduler().running().id());
+}
+
+void Lockstep::destroying(model::Instance &instance) {
+  begin(simulation_.scheduler().running(), Activity::Destroy).instance = &instance;
+}
+
+void Lockstep::destroyed() {
+  Activity &activity = activities_[simulation_.scheduler().running().id()];
+  if (activity.sections != 1) host::panic("lockstep: destroy took %u sections", activity.sections);
+  ++counts_.destroys;
+  for (Known &known : instances_)
+    if (known.instance.get() == activity.instance) known.alive = false;
+  activities_.erase(simulation_.scheduler().running().id());
+}
+
+/* ---- What the platform answers --------------------------------------------------------------- */
+
+void Lockstep::lookedUp(sim::Fiber &fiber, const sim::Lookup &lookup) {
+  Activity *activity = of(fiber);
+  if (!activity) return;
+  const KarstEntryHeader header = lookup.header ? *lookup.header : KarstEntryHeader{};
+  if (activity->instance) { /* the object's entry */
+    model::Instance &instance = *activity->instance;
+    activity->found = lookup.status == ZEL_OK;
+    if (activity->found) {
+      want(*activity, header.owner);
+    } else {
+      want(*activity, instance.useHint ? instance.hint : zel_UUID{});
+    }
+    return;
+  }
+  const auto kind =
+      lookup.call == sim::Call::KARST_FindEntry ? model::Input::Find : model::Input::FindWhole;
+  activity->inputs.add({kind, lookup.type, lookup.uuid, lookup.status, header, {}, nullptr});
+}
+
+void Lockstep::decoded(sim::Fiber &fiber, const char *record, zel_Status status,
+                       const void *content) {
+  Activity *activity = of(fiber);
+  if (!activity) return;
+  const uint8_t type = typeOf(record);
+  const auto *bytes = static_cast<const uint8_t *>(content);
+  activity->inputs.add(
+      {model::Input::Decoded, type, {}, status, {}, {bytes, bytes + sizeOf(type)}, nullptr});
+}
+
+void Lockstep::toldSelf(sim::Fiber &fiber, const zel_UUID &uuid) {
+  if (Activity *activity = of(fiber)) {
+    KarstEntryHeader header{};
+    header.uuid = uuid;
+    activity->inputs.add({model::Input::Self, 0, {}, ZEL_OK, header, {}, nullptr});
+  }
+}
+
+void Lockstep::subscribed(sim::Fiber &fiber, const KarstQuery &query, void *data,
+                          zel_Status status) {
+  Activity *activity = of(fiber);
+  if (!activity) return;
+  switch (query.type) {
+    case KARST_TYPE_HEALTH_STATUS:
+      activity->inputs.add(
+          {model::Input::Subscribed, query.type, query.uuid, status, {}, {}, data});
+      return;
+    case KARST_TYPE_NODE:
+    case KARST_TYPE_NET_INTERFACE:
+      if (status == ZEL_OK) ++cacheSubscriptions_;
+      activity->failed |= status != ZEL_OK;
+      return;
+    default: /* the object's, in a create; calls may come from here on */
+      if (activity->found) activity->instance->useHint = false;
+      activity->failed |= status != ZEL_OK;
+  }
+}
+
+void Lockstep::worldCreated(sim::Fiber &fiber, zel_Status status) {
+  if (Activity *activity = of(fiber)) activity->failed |= status != ZEL_OK;
+}
+
+void Lockstep::worldWaited(sim::Fiber &fiber, zel_Status status) {
+  if (status != ZEL_WORLD_STOPPING) return;
+  model_->worldEnds();
+  activities_.erase(fiber.id());
+}
+
+void Lockstep::preemptionAnswered(sim::Fiber &fiber, bool yes) {
+  if (Activity *activity = of(fiber))
+    activity->inputs.add({model::Input::Preemption, 0, {}, yes, {}, {}, nullptr});
+}
+
+/* ---- Sections -------------------------------------------------------------------------------- */
+
+void Lockstep::locked(sim::Fiber &fiber, const sim::Spinlock &lock) {
+  if (isCacheLock(lock) && !of(fiber))
+    host::panic("lockstep: %s takes the cache lock for no reason that is known",
+                fiber.name().c_str());
+}
+
+void Lockstep::unlocking(sim::Fiber &fiber, const sim::Spinlock &lock) {
+  if (!isCacheLock(lock) || !cache_) return;
+  Activity &activity = *of(fiber);
+  step(activity);
+  ++activity.sections;
+  ++sections_;
+  if (!activity.inputs.empty())
+    host::panic("lockstep: %s asked for more than it needs", fiber.name().c_str());
+  answersGrew();
+  for (auto &[id, other] : activities_) look(other);
+  compare();
+}
+
+void Lockstep::step(Activity &activity) {
+  switch (activity.kind) {
+    case Activity::Nodes:
+      return model_->nodeCall(activity.header, activity.status, activity.inputs);
+    case Activity::NetIfs:
+      return model_->netIfCall(activity.header, activity.status, activity.inputs);
+    case Activity::Health:
+      return model_->healthCall(activity.data, activity.status, activity.inputs);
+    case Activity::World:
+      return model_->worldSection(activity.inputs);
+    case Activity::Enable:
+      return stepEnable(activity);
+    case Activity::Disable:
+      return stepDisable(activity);
+    case Activity::Create:
+      if (activity.sections == 0) return; /* a reference, on which no lock depends */
+      [[fallthrough]];
+    case Activity::Object:
+      return stepTracking(activity);
+    case Activity::Destroy:
+      return model_->destroy(*activity.instance);
+  }
+}
+
+void Lockstep::stepEnable(Activity &activity) {
+  if (activity.failed) {
+    stepDisable(activity);
+  } else if (activity.sections == 0) {
+    model_->enabled = true;
+  } else {
+    model_->learnSelf(activity.inputs);
+  }
+}
+
+void Lockstep::stepDisable(Activity &activity) {
+  if (activity.disabling == 1) {
+    model_->forgetEntries();
+    activity.disabling = 2;
+  } else if (model_->enabled) {
+    model_->enabled = false;
+    activity.disabling = 1;
+  }
+}
+
+/* ---- Tracking -------------------------------------------------------------------------------- */
+
+void Lockstep::want(Activity &activity, const zel_UUID &node) {
+  activity.wanted = node;
+  look(activity);
+}
+
+void Lockstep::look(Activity &activity) {
+  if (!activity.instance || !activity.wanted || activity.tracked) return;
+  if (model::Resolver::tracksAlready(*activity.instance, *activity.wanted)) {
+    activity.mayStay = true;
+  } else {
+    activity.mayMove = true;
+  }
+}
+
+void Lockstep::stepTracking(Activity &activity) {
+  look(activity);
+  if (activity.kind == Activity::Create && (activity.tracked || !activity.mayMove))
+    return model_->destroy(*activity.instance); /* of an instance that came to nothing */
+  if (!activity.mayMove || activity.tracked)
+    host::panic("lockstep: an instance is tracked though there is nothing to change");
+  activity.tracked = true;
+  model_->track(*activity.instance, *activity.wanted);
+}
+
+void Lockstep::objectReturned(Activity &activity) {
+  model::Instance &instance = *activity.instance;
+  if (activity.found) instance.useHint = false;
+  if (activity.tracked || activity.mayStay || instance.destroyed) return;
+  host::panic("lockstep: an object's call has changed nothing where it should have");
+}
+
+/* ---- What clients see ------------------------------------------------------------------------ */
+
+model::Instance &Lockstep::instanceOf(const void *real) {
+  for (Known &known : instances_)
+    if (known.real == real && known.alive) return *known.instance;
+  /* Destroyed, with its last calls to come; the newest, since memory is used again. */
+  for (auto known = instances_.rbegin(); known != instances_.rend(); ++known)
+    if (known->real == real) return *known->instance;
+  host::panic("lockstep: a call for an instance that nobody knows");
+}
+
+size_t Lockstep::saw(model::Instance &instance, size_t from, const model::Answer &answer) {
+  const auto begin = instance.answers.begin() + static_cast<ptrdiff_t>(from);
+  const auto found = std::find(begin, instance.answers.end(), answer);
+  ++checks_;
+  if (found != instance.answers.end()) return static_cast<size_t>(found - instance.answers.begin());
+  /* Written under the instance's lock, and seen before the section that wrote it has ended. */
+  for (Known &known : instances_)
+    if (known.instance.get() == &instance) known.expected.push_back(answer);
+  return instance.answers.size();
+}
+
+void Lockstep::answersGrew() {
+  for (Known &known : instances_) {
+    const std::vector<model::Answer> &answers = known.instance->answers;
+    if (answers.size() == known.answersCounted) continue;
+    counts_.answers += answers.size() - known.answersCounted;
+    known.answersCounted = answers.size();
+    for (const model::Answer &one : known.expected)
+      if (one != answers.back())
+        host::panic(
+            "lockstep: a client saw \"%s\", which the instance never had; it now has \"%s\"",
+            one.text().c_str(), answers.back().text().c_str());
+    known.expected.clear();
+  }
+}
+
+/* ---- Comparison ------------------------------------------------------------------------------ */
+
+void Lockstep::compare() {
+  ++checks_;
+  const zel_UUID cache{};
+  require<int>(cache_->enabled, model_->enabled, "enabled", cache);
+  size_t inUse = 0;
+  for (uint32_t i = 0; i < KARST_RESOLVER_NODE_POOL_SIZE; i++) {
+    const KARSTResolverNode &real = cache_->nodePool[i];
+    if (std::memcmp(real.tag, KARST_RESOLVER_TAG_NODE, sizeof real.tag) != 0) continue;
+    ++inUse;
+    const auto found = model_->nodes.find(real.uuid);
+    if (found == model_->nodes.end())
+      host::panic("lockstep: node %s is cached and should not be", name(real.uuid).c_str());
+    compareNode(*found->second, real);
+  }
+  require(inUse, model_->nodes.size(), "nodes", cache);
+
+  auto netIf = model_->netIfs.begin();
+  for (const KARSTResolverLink *link = cache_->netIfs.next; link != &cache_->netIfs;
+       link = link->next) {
+    if (netIf == model_->netIfs.end())
+      host::panic("lockstep: more interfaces than there should be");
+    compareNetIf(**netIf++, *KARST_RESOLVER_CONTAINER(link, KARSTResolverNetIf, cacheLinks));
+  }
+  if (netIf != model_->netIfs.end()) host::panic("lockstep: fewer interfaces than there should be");
+
+  auto dirty = model_->dirty.begin();
+  for (const KARSTResolverLink *link = cache_->dirtyNodes.next; link != &cache_->dirtyNodes;
+       link = link->next) {
+    const zel_UUID &uuid = KARST_RESOLVER_CONTAINER(link, KARSTResolverNode, dirtyLinks)->uuid;
+    if (dirty == model_->dirty.end() || (*dirty++)->uuid != uuid)
+      host::panic("lockstep: node %s stands where it should not in the dirty queue",
+                  name(uuid).c_str());
+  }
+  if (dirty != model_->dirty.end())
+    host::panic("lockstep: node %s should be in the dirty queue", name((*dirty)->uuid).c_str());
+}
+
+void Lockstep::compareNode(const model::Node &node, const KARSTResolverNode &real) {
+  const zel_UUID &uuid = node.uuid;
+  require<unsigned>(real.refCount, node.references, "references", uuid);
+  require<int>(real.reachable, node.reachable, "reachable", uuid);
+  require<int>(real.isSelf, node.self, "isSelf", uuid);
+  require<int>(real.isWitness, node.witness, "isWitness", uuid);
+  require<int>(real.rescanSeen, 0, "rescanSeen", uuid);
+  require(real.majorVersion, node.major, "majorVersion", uuid);
+  require(real.minorVersion, node.minor, "minorVersion", uuid);
+  require(lengthOf(real.netIfList), node.netIfs.size(), "interfaces", uuid);
+  auto netIf = node.netIfs.begin();
+  for (const KARSTResolverLink *link = real.netIfList.next; link != &real.netIfList;
+       link = link->next)
+    if (KARST_RESOLVER_CONTAINER(link, KARSTResolverNetIf, nodeLinks)->uuid != (*netIf++)->uuid)
+      host::panic("lockstep: the interfaces of %s are out of order", name(uuid).c_str());
+  compareInstances({node.instances.begin(), node.instances.end()}, real.instanceList);
+  model::Answer set = model::Answer::of(node.set.state, real.locators);
+  if (set != node.set)
+    host::panic("lockstep: the locators of %s are \"%s\", and should be \"%s\"", name(uuid).c_str(),
+                set.text().c_str(), node.set.text().c_str());
+}
+
+void Lockstep::compareNetIf(const model::NetIf &netIf, const KARSTResolverNetIf &real) {
+  const zel_UUID &uuid = netIf.uuid;
+  if (real.uuid != uuid) host::panic("lockstep: interface %s is out of order", name(uuid).c_str());
+  if (!real.node || real.node->uuid != netIf.node->uuid)
+    host::panic("lockstep: interface %s has another owner", name(uuid).c_str());
+  require<unsigned>(real.refCount, netIf.references, "references", uuid);
+  require<int>(real.healthy, netIf.healthy, "healthy", uuid);
+  require<int>(real.healthSubInstalled, netIf.watched, "healthSubInstalled", uuid);
+  require<int>(real.rescanSeen, 0, "rescanSeen", uuid);
+  require(real.health.healthFlags, netIf.health.healthFlags, "healthFlags", uuid);
+  if (std::memcmp(&real.info, &netIf.info, sizeof real.info) != 0)
+    host::panic("lockstep: the record of interface %s differs", name(uuid).c_str());
+}
+
+void Lockstep::compareInstances(const std::vector<model::Instance *> &instances,
+                                const KARSTResolverLink &head) {
+  auto instance = instances.begin();
+  for (const KARSTResolverLink *link = head.next; link != &head; link = link->next) {
+    if (instance == instances.end())
+      host::panic("lockstep: a node has more instances than it should");
+    compareInstance(**instance++,
+                    *KARST_RESOLVER_CONTAINER(link, KARSTResolverInstance, nodeLinks));
+  }
+  if (instance != instances.end())
+    host::panic("lockstep: a node has fewer instances than it should");
+}
+
+void Lockstep::compareInstance(model::Instance &instance, KARSTResolverInstance &real) {
+  const auto known = std::find_if(instances_.begin(), instances_.end(), [&](const Known &one) {
+    return one.instance.get() == &instance;
+  });
+  if (!known->real) known->real = &real; /* its first attachment */
+  if (known->real != &real) host::panic("lockstep: a node's instances are out of order");
+  require<int>(real.nodeChanged, instance.changed, "nodeChanged", instance.bound);
+  if (real.boundNodeUUID != instance.bound || real.node->uuid != instance.node->uuid)
+    host::panic("lockstep: an instance is bound elsewhere");
+  const model::Answer answer = model::Answer::of(real.state, real.locators);
+  if (answer != instance.answer)
+    host::panic("lockstep: an instance answers \"%s\", and should \"%s\"", answer.text().c_str(),
+                instance.answer.text().c_str());
+}
+
+/* ---- At rest --------------------------------------------------------------------------------- */
+
+void Lockstep::atRest() {
+  for (const auto &[id, activity] : activities_)
+    if (activity.kind != Activity::World)
+      host::panic("lockstep: a fiber is still inside the module");
+  if (!cache_) return;
+  compare();
+  const zel_UUID cache{};
+  size_t alive = 0;
+  for (const Known &known : instances_) {
+    if (!known.expected.empty())
+      host::panic("lockstep: a client saw \"%s\", which the instance never had",
+                  known.expected.front().text().c_str());
+    if (!known.alive) continue;
+    ++alive;
+    const model::Answer answer = model::Answer::of(known.real->state, known.real->locators);
+    if (answer != known.instance->answer)
+      host::panic("lockstep: an instance answers \"%s\", and should \"%s\"", answer.text().c_str(),
+                  known.instance->answer.text().c_str());
+    require<uint64_t>(known.real->refCount, host::isZero(known.instance->object) ? 1 : 2,
+                      "references of an instance", known.instance->bound);
+  }
+  require<uint64_t>(cache_->refCount, cacheSubscriptions_ + model_->healthSubscriptions() + alive,
+                    "references of the cache", cache);
+  require(lengthOf(cache_->freeNodes), KARST_RESOLVER_NODE_POOL_SIZE - model_->nodes.size(),
+          "free nodes", cache);
+  require(lengthOf(cache_->freeNetIfs), KARST_RESOLVER_NETIF_POOL_SIZE - model_->slots.size(),
+          "free interfaces", cache);
+  if (!model_->enabled) return;
+  if (!model_->dirty.empty())
+    host::panic("lockstep: node %s is dirty and nobody works on it",
+                name(model_->dirty.front()->uuid).c_str());
+}

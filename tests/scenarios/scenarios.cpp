@@ -1,0 +1,336 @@
+/* Scenarios as tables: who acts, what they do how often, on which host. A new one is a new row. No
+ * lock.
+ */
+#include "tests/scenarios/scenarios.h"
+
+#include <algorithm>
+
+#include "sim/random.h"
+#include "tests/scenarios/actions.h"
+#include "tests/scenarios/cluster.h"
+
+namespace {
+
+using sim::Operation;
+using sim::Plan;
+
+struct Weight {
+  Action action;
+  unsigned weight;
+};
+
+struct Actor {
+  const char *name;
+  unsigned weight; /* its share of the operations */
+  std::vector<Weight> actions;
+};
+
+struct Profile {
+  const char *name;
+  const char *about;
+  std::vector<Actor> actors;
+  size_t length = 60;
+  unsigned phases = 2;
+  unsigned faults = 0;       /* most that are planned */
+  unsigned callbackWork = 2; /* scheduling points */
+  bool preemption = true;
+  size_t queueBound = 1024;
+  uint32_t traceSlots = 1 << 12;      /* enough for all events between two times of rest */
+  std::vector<Operation> script = {}; /* of a small scenario: the plan, whatever the seed */
+};
+
+/* ---- Who does what --------------------------------------------------------------------------- */
+
+const std::vector<Weight> nodeEvents = {
+    {Action::PutNode, 4}, {Action::RemoveNode, 3}, {Action::Garble, 1}};
+const std::vector<Weight> netIfEvents = {{Action::PutNetIf, 6},
+                                         {Action::RemoveNetIf, 3},
+                                         {Action::PutHealth, 6},
+                                         {Action::RemoveHealth, 2},
+                                         {Action::Garble, 1}};
+const std::vector<Weight> objectEvents = {{Action::PutObject, 5}, {Action::RemoveObject, 3}};
+const std::vector<Weight> callers = {
+    {Action::Create, 5}, {Action::SetCallback, 4}, {Action::Read, 3}, {Action::Destroy, 3}};
+const std::vector<Weight> readers = {{Action::Read, 1}};
+const std::vector<Weight> statusCalls = {
+    {Action::Usable, 3}, {Action::Unusable, 2}, {Action::Interrupt, 2}};
+const std::vector<Weight> disturbances = {
+    {Action::Resync, 1}, {Action::Preempt, 1}, {Action::Pause, 1}};
+const std::vector<Weight> loads = {{Action::Load, 2}, {Action::Unload, 2}, {Action::Pause, 1}};
+
+Operation doing(uint8_t phase, uint8_t actor, Action action, uint8_t a = 0, uint8_t b = 0,
+                uint8_t c = 0) {
+  return {phase, actor, static_cast<uint8_t>(action), a, b, c};
+}
+
+/* Node n, its healthy interface n at one IPv4 address, and object n that it owns. */
+void putWhole(std::vector<Operation> &operations, uint8_t node) {
+  operations.push_back(doing(0, 0, Action::PutNode, node, 0));
+  operations.push_back(doing(0, 0, Action::PutHealth, node, 0));
+  operations.push_back(doing(0, 0, Action::PutNetIf, node, node, 1));
+  operations.push_back(doing(0, 0, Action::PutObject, node, node));
+}
+
+/* Two nodes, the module loaded and enabled, and then what overlaps. */
+std::vector<Operation> smallScript(std::initializer_list<Operation> overlapping) {
+  std::vector<Operation> operations;
+  putWhole(operations, 1);
+  putWhole(operations, 2);
+  operations.push_back(doing(0, 0, Action::Usable));
+  operations.push_back(doing(0, 0, Action::Load));
+  operations.insert(operations.end(), overlapping);
+  return operations;
+}
+
+/* ---- The table ------------------------------------------------------------------------------- */
+
+std::vector<Profile> profiles() {
+  const Actor nodes{"nodes", 3, nodeEvents}, netIfs{"interfaces", 4, netIfEvents},
+      objects{"objects", 3, objectEvents}, one{"caller-1", 4, callers}, two{"caller-2", 4, callers},
+      reader{"reader", 3, readers}, status{"status", 2, statusCalls},
+      trouble{"trouble", 1, disturbances}, loader{"loader", 2, loads};
+  const Actor rareLoader{"loader", 1, {{Action::Load, 1}}};
+  const Actor floods{"floods", 3, {{Action::Flood, 4}, {Action::Drain, 3}, {Action::Resync, 1}}};
+
+  std::vector<Profile> table;
+  table.push_back({.name = "life",
+                   .about = "loads and unloads while the directory's status changes",
+                   .actors = {nodes, netIfs, status, loader, one}});
+  table.push_back({.name = "storms",
+                   .about = "enables and disables that overlap with late last calls",
+                   .actors = {status, status, nodes, netIfs, one}});
+  table.push_back({.name = "events",
+                   .about = "every kind of entry comes, changes, goes, and is lost in overflows",
+                   .actors = {nodes, netIfs, netIfs, objects, trouble, one},
+                   .length = 90,
+                   .queueBound = 2});
+  table.push_back({.name = "crowd",
+                   .about = "more nodes and interfaces than there are slots",
+                   .actors = {floods, netIfs, one, rareLoader},
+                   .length = 24,
+                   .queueBound = 64,
+                   .traceSlots = 1 << 15});
+  table.push_back({.name = "churn",
+                   .about = "instances come and go under callbacks that take long",
+                   .actors = {one, two, {"caller-3", 4, callers}, nodes, netIfs, trouble},
+                   .length = 90,
+                   .callbackWork = 12});
+  table.push_back({.name = "moves",
+                   .about = "objects change owners while their instances are refreshed",
+                   .actors = {objects, objects, netIfs, one, two},
+                   .length = 80});
+  table.push_back({.name = "readers",
+                   .about = "several readers of the same instances, and writers",
+                   .actors = {reader, reader, {"reader-3", 3, readers}, netIfs, nodes, one}});
+  table.push_back({.name = "faults",
+                   .about = "platform calls fail at any moment, and everything else goes on",
+                   .actors = {nodes, netIfs, objects, status, loader, one, two, trouble},
+                   .length = 70,
+                   .faults = 6});
+
+  const Actor first{"first", 1, {}}, second{"second", 1, {}};
+  table.push_back({.name = "small-destroy",
+                   .about = "an instance is destroyed while its node changes",
+                   .actors = {first, second},
+                   .preemption = false,
+                   .script = smallScript(
+                       {doing(1, 0, Action::Create, 0, 1), doing(1, 0, Action::SetCallback, 0, 1),
+                        doing(2, 0, Action::Destroy, 0), doing(2, 1, Action::PutNetIf, 1, 1, 2)})});
+  table.push_back({.name = "small-move",
+                   .about = "an object moves while its node changes and its instance is read",
+                   .actors = {first, second},
+                   .preemption = false,
+                   .script = smallScript(
+                       {doing(1, 0, Action::Create, 0, 9), doing(1, 0, Action::SetCallback, 0, 1),
+                        doing(2, 0, Action::PutObject, 1, 2), doing(2, 0, Action::Read, 0),
+                        doing(2, 1, Action::PutHealth, 1, 1)})});
+  table.push_back(
+      {.name = "small-unload",
+       .about = "the module goes while the directory is interrupted",
+       .actors = {first, second},
+       .preemption = false,
+       .script = smallScript({doing(1, 0, Action::Create, 0, 9), doing(2, 0, Action::Unload),
+                              doing(2, 1, Action::Interrupt)})});
+  table.push_back(
+      {.name = "small-storm",
+       .about = "an interruption while an instance is made",
+       .actors = {first, second},
+       .preemption = false,
+       .script = smallScript({doing(2, 0, Action::Create, 0, 1), doing(2, 1, Action::Interrupt)})});
+  return table;
+}
+
+/* ---- Plans ----------------------------------------------------------------------------------- */
+
+constexpr sim::Call faultable[] = {sim::Call::zel_HeapAllocWithRA,
+                                   sim::Call::zel_SpinlockCreate,
+                                   sim::Call::TOLM_WorldCreate,
+                                   sim::Call::KARST_Subscribe,
+                                   sim::Call::KARST_FindEntry,
+                                   sim::Call::KARST_FindFullEntryByQuery,
+                                   sim::Call::KARST_FindFullEntryByHeader,
+                                   sim::Call::ExprMsh_UmshSingleStructure,
+                                   sim::Call::zel_HeapCreate,
+                                   sim::Call::KARST_RegisterStatusCallback};
+
+uint8_t among(sim::Random &random, size_t count, uint8_t from = 0) {
+  return static_cast<uint8_t>(from + random.below(count));
+}
+
+Action chosen(sim::Random &random, const std::vector<Weight> &weights) {
+  unsigned total = 0;
+  for (const Weight &one : weights) total += one.weight;
+  size_t point = random.below(total);
+  for (const Weight &one : weights) {
+    if (point < one.weight) return one.action;
+    point -= one.weight;
+  }
+  return weights.back().action;
+}
+
+Operation drawn(sim::Random &random, Action action) {
+  const uint8_t node = among(random, 4, 1), netIf = among(random, 5, 1);
+  switch (action) {
+    case Action::PutNode:
+      return doing(0, 0, action, node, among(random, 8));
+    case Action::PutNetIf:
+      /* Mostly below the same owner. */
+      return doing(0, 0, action, netIf,
+                   random.below(4) == 0 ? node : static_cast<uint8_t>(1 + netIf % 4),
+                   among(random, 256));
+    case Action::RemoveNetIf:
+    case Action::RemoveHealth:
+      return doing(0, 0, action, netIf);
+    case Action::PutHealth:
+      return doing(0, 0, action, netIf, random.below(3) == 0 ? among(random, 3) : uint8_t{0});
+    case Action::PutObject:
+      return doing(0, 0, action, among(random, 4), among(random, 5));
+    case Action::RemoveObject:
+      return doing(0, 0, action, among(random, 4));
+    case Action::Garble:
+      return doing(0, 0, action, netIf, among(random, 3));
+    case Action::Flood:
+      return doing(0, 0, action, among(random, 40, 8), among(random, 100));
+    case Action::Drain:
+      return doing(0, 0, action, among(random, 60, 20), among(random, 100));
+    case Action::Create:
+      return doing(0, 0, action, among(random, Cluster::clients),
+                   random.below(2) == 0 ? node : among(random, 4, 8), among(random, 16));
+    case Action::SetCallback:
+    case Action::Read:
+    case Action::Destroy:
+      return doing(0, 0, action, among(random, Cluster::clients), among(random, 4));
+    case Action::Pause:
+      return doing(0, 0, action, among(random, 4));
+    case Action::Preempt:
+      return doing(0, 0, action, among(random, 3, 1));
+    default:
+      return doing(0, 0, action, node);
+  }
+}
+
+class Tabled final : public sim::Scenario {
+ public:
+  explicit Tabled(Profile profile) : profile_(std::move(profile)) {}
+
+  std::string name() const override { return profile_.name; }
+  std::string about() const override { return profile_.about; }
+  bool small() const override { return !profile_.script.empty(); }
+  std::vector<std::string> actors() const override {
+    std::vector<std::string> names;
+    for (const Actor &actor : profile_.actors) names.emplace_back(actor.name);
+    return names;
+  }
+  std::string describe(const Operation &operation) const override { return textOf(operation); }
+  Plan plan(uint64_t seed, size_t length) const override;
+  sim::Outcome play(const Plan &plan, const sim::Run &run) const override;
+
+ private:
+  void playPhase(Cluster &cluster, const std::vector<Operation> &operations) const;
+
+  const Profile profile_;
+};
+
+Plan Tabled::plan(uint64_t seed, size_t length) const {
+  if (small()) return {profile_.script, {}};
+  if (length == 0) length = profile_.length;
+  sim::Random random(seed);
+  Plan plan;
+  for (uint8_t node = 1; node <= 3; node++)
+    if (random.below(4) != 0) putWhole(plan.operations, node);
+  const bool usableFirst = random.below(2) == 0;
+  if (usableFirst) plan.operations.push_back(doing(0, 0, Action::Usable));
+  plan.operations.push_back(doing(0, 0, Action::Load));
+  if (!usableFirst) plan.operations.push_back(doing(0, 0, Action::Usable));
+
+  unsigned shares = 0;
+  for (const Actor &actor : profile_.actors) shares += actor.weight;
+  for (size_t i = 0; i < length; i++) {
+    size_t point = random.below(shares);
+    uint8_t actor = 0;
+    while (point >= profile_.actors[actor].weight) point -= profile_.actors[actor++].weight;
+    Operation operation = drawn(random, chosen(random, profile_.actors[actor].actions));
+    operation.actor = actor;
+    operation.phase = static_cast<uint8_t>(1 + i * profile_.phases / length);
+    plan.operations.push_back(operation);
+  }
+  for (size_t i = profile_.faults ? random.below(profile_.faults + 1) : 0; i > 0; i--)
+    plan.faults.push_back({faultable[random.below(std::size(faultable))],
+                           static_cast<uint32_t>(1 + random.below(200)),
+                           static_cast<uint32_t>(1 + random.below(4))});
+  return plan;
+}
+
+void Tabled::playPhase(Cluster &cluster, const std::vector<Operation> &operations) const {
+  std::vector<std::vector<Operation>> byActor(profile_.actors.size());
+  for (const Operation &operation : operations)
+    byActor[operation.actor % byActor.size()].push_back(operation);
+  for (size_t actor = 0; actor < byActor.size(); actor++) {
+    if (byActor[actor].empty()) continue;
+    cluster.simulation().spawn(profile_.actors[actor].name, [&cluster, mine = byActor[actor]] {
+      for (const Operation &operation : mine) cluster.perform(operation);
+    });
+  }
+}
+
+sim::Outcome Tabled::play(const Plan &plan, const sim::Run &run) const {
+  sim::Settings settings;
+  settings.seed = run.seed;
+  settings.historyLength = run.historyLength;
+  settings.stepLimit = run.stepLimit;
+  settings.queueBound = profile_.queueBound;
+  settings.witness = run.seed % 8 == 0;
+  settings.tracing.classLevel = 2;
+  settings.tracing.throttling = false;
+  settings.tracing.notify = false;
+  settings.tracing.slots = profile_.traceSlots;
+  Cluster cluster(settings, run.module, profile_.callbackWork);
+  sim::Simulation &simulation = cluster.simulation();
+  if (profile_.preemption) simulation.setPreemption(sim::Preemption::Random);
+  for (const sim::PlannedFault &fault : plan.faults)
+    simulation.failAt(fault.call, fault.nth, fault.count);
+
+  for (auto begin = plan.operations.begin(); begin != plan.operations.end();) {
+    const uint8_t phase = begin->phase;
+    const auto end = std::find_if(begin, plan.operations.end(),
+                                  [=](const Operation &one) { return one.phase != phase; });
+    /* What a small scenario begins with is not part of the search. */
+    if (!small() || phase > 1)
+      simulation.setStrategy(std::make_unique<sim::Borrowed>(*run.strategy));
+    playPhase(cluster, {begin, end});
+    cluster.rest();
+    begin = end;
+  }
+  if (small()) simulation.setSwitching(sim::Switching::WhenBlocked);
+  cluster.close();
+  return {simulation.steps(), simulation.traceHash(), cluster.performed(),
+          simulation.faultsInjected(), cluster.lockstep().checks()};
+}
+
+}  // namespace
+
+std::vector<std::unique_ptr<sim::Scenario>> scenarios() {
+  std::vector<std::unique_ptr<sim::Scenario>> all;
+  for (Profile &profile : profiles()) all.push_back(std::make_unique<Tabled>(std::move(profile)));
+  return all;
+}

@@ -169,7 +169,7 @@ extern "C" uint32_t QXT_GetMaxAssocCount(void) {
 extern "C" uint64_t tolmapi_GetReturnAddress(uint32_t frame) {
   PlatformCall call(Call::tolmapi_GetReturnAddress, Argument::number(frame));
   /* Frame 0 is the caller's: the one that this function's own frame leads to. */
-  return host::returnAddressOf(__builtin_frame_address(0), frame + 1);
+  return host::returnAddressOf(__builtin_frame_address(0), frame + 1, call.fiber().stackTop());
 }
 
 extern "C" bool TOLM_IsWitnessNode(void) {

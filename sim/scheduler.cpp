@@ -79,20 +79,38 @@ void Scheduler::reportDeadlock(const char *headline) const {
 
 /* ---- Making and ending fibers ---------------------------------------------------------------- */
 
+namespace {
+
+struct StackRange {
+  char *bottom;
+  char *top;
+};
+
+/* Of the one OS thread; asked for once, since the answer takes long. */
+const StackRange &ownStack() {
+  static const StackRange range = [] {
+    pthread_attr_t attributes;
+    void *bottom = nullptr;
+    size_t size = 0;
+    if (pthread_getattr_np(pthread_self(), &attributes) != 0 ||
+        pthread_attr_getstack(&attributes, &bottom, &size) != 0)
+      host::panic("the stack of the simulator's thread is not known");
+    pthread_attr_destroy(&attributes);
+    return StackRange{static_cast<char *>(bottom), static_cast<char *>(bottom) + size};
+  }();
+  return range;
+}
+
+}  // namespace
+
 Scheduler::Scheduler(std::unique_ptr<Strategy> strategy) : strategy_(std::move(strategy)) {
   if (instance_) host::panic("a second simulation while the first one is still there");
   instance_ = this;
   driver_.name_ = intern("driver");
   driver_.threadSanitizerFiber_ = sanitizers::threadOfCaller();
-  pthread_attr_t attributes;
-  void *bottom = nullptr;
-  size_t size = 0;
-  if (pthread_getattr_np(pthread_self(), &attributes) != 0 ||
-      pthread_attr_getstack(&attributes, &bottom, &size) != 0)
-    host::panic("the stack of the simulator's thread is not known");
-  pthread_attr_destroy(&attributes);
-  driver_.stackBottom_ = static_cast<char *>(bottom);
-  driver_.stackTop_ = driver_.stackBottom_ + size;
+  const StackRange &own = ownStack();
+  driver_.stackBottom_ = own.bottom;
+  driver_.stackTop_ = own.top;
 }
 
 Scheduler::~Scheduler() {

@@ -169,24 +169,36 @@ model::Instance &Lockstep::creating(const zel_UUID &object, const zel_UUID &node
   return instance;
 }
 
+Lockstep::Known &Lockstep::known(const model::Instance &instance) {
+  return *std::find_if(instances_.begin(), instances_.end(),
+                       [&](const Known &one) { return one.instance.get() == &instance; });
+}
+
 void Lockstep::created(zel_Status status) {
   Activity &activity = activities_[simulation_.scheduler().running().id()];
   model::Instance &instance = *activity.instance;
-  const bool resolved = std::any_of(
-      instance.answers.begin(), instance.answers.end(),
-      [](const model::Answer &one) { return one.state == KARST_RESOLVER_STATE_RESOLVED; });
-  const bool good = status == ZEL_OK ? resolved && !instance.destroyed && !activity.failed
+  const bool good = status == ZEL_OK ? !instance.destroyed && !activity.failed
                                      : instance.destroyed || activity.sections == 0;
   if (!good)
-    host::panic("lockstep: create returned 0x%x after %u sections, resolved %d, destroyed %d",
-                status, activity.sections, resolved, instance.destroyed);
+    host::panic("lockstep: create returned 0x%x after %u sections, destroyed %d", status,
+                activity.sections, instance.destroyed);
   if (activity.sections > 0) ++counts_.creates;
-  if (status != ZEL_OK) {
+  if (status == ZEL_OK) {
+    requireResolved(known(instance));
+  } else {
     if (activity.sections > 0) ++counts_.destroys;
-    for (Known &known : instances_)
-      if (known.instance.get() == &instance) known.alive = false;
+    known(instance).alive = false;
   }
   activities_.erase(simulation_.scheduler().running().id());
+}
+
+/* At some time since its first tracking; perhaps by a section that has not ended. */
+void Lockstep::requireResolved(Known &made) KARST_UNCHECKED {
+  for (const model::Answer &one : made.instance->answers)
+    if (one.state == KARST_RESOLVER_STATE_RESOLVED) return;
+  if (!made.real || made.real->state != KARST_RESOLVER_STATE_RESOLVED)
+    host::panic("lockstep: create succeeded, and the instance never was resolved");
+  made.expected.push_back(model::Answer::of(made.real->state, made.real->locators));
 }
 
 void Lockstep::destroying(model::Instance &instance) {
@@ -197,8 +209,7 @@ void Lockstep::destroyed() {
   Activity &activity = activities_[simulation_.scheduler().running().id()];
   if (activity.sections != 1) host::panic("lockstep: destroy took %u sections", activity.sections);
   ++counts_.destroys;
-  for (Known &known : instances_)
-    if (known.instance.get() == activity.instance) known.alive = false;
+  known(*activity.instance).alive = false;
   activities_.erase(simulation_.scheduler().running().id());
 }
 
@@ -370,7 +381,11 @@ void Lockstep::stepTracking(Activity &activity) {
 void Lockstep::objectReturned(Activity &activity) {
   model::Instance &instance = *activity.instance;
   if (activity.found) instance.useHint = false;
-  if (activity.tracked || activity.mayStay || instance.destroyed) return;
+  /* A destroy may have marked the instance already, and its section not have ended. */
+  const bool ends = std::any_of(activities_.begin(), activities_.end(), [&](const auto &other) {
+    return other.second.kind == Activity::Destroy && other.second.instance == &instance;
+  });
+  if (activity.tracked || activity.mayStay || instance.destroyed || ends) return;
   host::panic("lockstep: an object's call has changed nothing where it should have");
 }
 
@@ -391,8 +406,7 @@ size_t Lockstep::saw(model::Instance &instance, size_t from, const model::Answer
   ++checks_;
   if (found != instance.answers.end()) return static_cast<size_t>(found - instance.answers.begin());
   /* Written under the instance's lock, and seen before the section that wrote it has ended. */
-  for (Known &known : instances_)
-    if (known.instance.get() == &instance) known.expected.push_back(answer);
+  known(instance).expected.push_back(answer);
   return instance.answers.size();
 }
 
@@ -500,11 +514,9 @@ void Lockstep::compareInstances(const std::vector<model::Instance *> &instances,
 }
 
 void Lockstep::compareInstance(model::Instance &instance, KARSTResolverInstance &real) {
-  const auto known = std::find_if(instances_.begin(), instances_.end(), [&](const Known &one) {
-    return one.instance.get() == &instance;
-  });
-  if (!known->real) known->real = &real; /* its first attachment */
-  if (known->real != &real) host::panic("lockstep: a node's instances are out of order");
+  Known &seen = known(instance);
+  if (!seen.real) seen.real = &real; /* its first attachment */
+  if (seen.real != &real) host::panic("lockstep: a node's instances are out of order");
   require<int>(real.nodeChanged, instance.changed, "nodeChanged", instance.bound);
   if (real.boundNodeUUID != instance.bound || real.node->uuid != instance.node->uuid)
     host::panic("lockstep: an instance is bound elsewhere");

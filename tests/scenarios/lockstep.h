@@ -84,6 +84,14 @@ class Lockstep final : public sim::Observer {
     unsigned disabling = 0;
   };
 
+  struct Known {
+    std::unique_ptr<model::Instance> instance;
+    KARSTResolverInstance *real = nullptr; /* once the module has shown it */
+    std::vector<model::Answer> expected;   /* seen, and still to come */
+    size_t answersCounted = 1;
+    bool alive = true;
+  };
+
   Activity &begin(const sim::Fiber &fiber, Activity::Kind kind);
   Activity *of(const sim::Fiber &fiber);
   void step(Activity &activity);
@@ -102,18 +110,13 @@ class Lockstep final : public sim::Observer {
                         const KARSTResolverLink &head);
   void compareInstance(model::Instance &instance, KARSTResolverInstance &real);
   model::Instance &instanceOf(const void *real);
+  Known &known(const model::Instance &instance);
+  void requireResolved(Known &made);
 
   sim::Simulation &simulation_;
   std::unique_ptr<model::Resolver> model_;
   KARSTResolverCache *cache_ = nullptr;
   std::map<uint32_t, Activity> activities_; /* by fiber */
-  struct Known {
-    std::unique_ptr<model::Instance> instance;
-    KARSTResolverInstance *real = nullptr; /* once the module has shown it */
-    std::vector<model::Answer> expected;   /* seen, and still to come */
-    size_t answersCounted = 1;
-    bool alive = true;
-  };
   std::vector<Known> instances_;
   size_t cacheSubscriptions_ = 0; /* of nodes and interfaces, whose last call has not returned */
   uint64_t checks_ = 0, sections_ = 0;

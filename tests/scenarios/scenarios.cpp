@@ -29,13 +29,13 @@ struct Profile {
   const char *name;
   const char *about;
   std::vector<Actor> actors;
-  size_t length = 60;
-  unsigned phases = 2;
+  size_t length = 200;
+  unsigned phases = 3;
   unsigned faults = 0;       /* most that are planned */
   unsigned callbackWork = 2; /* scheduling points */
   bool preemption = true;
   size_t queueBound = 1024;
-  uint32_t traceSlots = 1 << 12;      /* enough for all events between two times of rest */
+  uint32_t traceSlots = 1 << 13;      /* enough for all events between two times of rest */
   std::vector<Operation> script = {}; /* of a small scenario: the plan, whatever the seed */
 };
 
@@ -102,7 +102,7 @@ std::vector<Profile> profiles() {
   table.push_back({.name = "events",
                    .about = "every kind of entry comes, changes, goes, and is lost in overflows",
                    .actors = {nodes, netIfs, netIfs, objects, trouble, one},
-                   .length = 90,
+                   .length = 300,
                    .queueBound = 2});
   table.push_back({.name = "crowd",
                    .about = "more nodes and interfaces than there are slots",
@@ -113,19 +113,19 @@ std::vector<Profile> profiles() {
   table.push_back({.name = "churn",
                    .about = "instances come and go under callbacks that take long",
                    .actors = {one, two, {"caller-3", 4, callers}, nodes, netIfs, trouble},
-                   .length = 90,
+                   .length = 300,
                    .callbackWork = 12});
   table.push_back({.name = "moves",
                    .about = "objects change owners while their instances are refreshed",
                    .actors = {objects, objects, netIfs, one, two},
-                   .length = 80});
+                   .length = 240});
   table.push_back({.name = "readers",
                    .about = "several readers of the same instances, and writers",
                    .actors = {reader, reader, {"reader-3", 3, readers}, netIfs, nodes, one}});
   table.push_back({.name = "faults",
                    .about = "platform calls fail at any moment, and everything else goes on",
                    .actors = {nodes, netIfs, objects, status, loader, one, two, trouble},
-                   .length = 70,
+                   .length = 200,
                    .faults = 6});
 
   const Actor first{"first", 1, {}}, second{"second", 1, {}};

@@ -24,7 +24,7 @@
   X(Drain, "remove $1 times eight interfaces and their nodes") \
   X(Create, "client $1: create for target $2, options $3")     \
   X(SetCallback, "client $1: set callback, kind $2")           \
-  X(Read, "client $1: read")                                   \
+  X(Read, "client $1: read, kind $2")                          \
   X(Destroy, "client $1: destroy")                             \
   X(Load, "load the module")                                   \
   X(Unload, "unload the module")                               \

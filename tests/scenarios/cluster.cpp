@@ -42,6 +42,15 @@ void leftBehind(const std::string &report) {
   host::panic("left behind: %s", report.c_str());
 }
 
+/* Nothing is written behind the locators that are counted, and no more than there is room for. */
+void requireWithin(const KARSTResolverNodeLocators &set) {
+  bool within = set.count <= set.capacity;
+  for (size_t i = set.count; within && i < std::size(set.locators); i++)
+    within = set.locators[i].networkType == canary * 0x01010101u;
+  if (!within)
+    host::panic("a read writes behind the room that it has for %u locators", set.capacity);
+}
+
 }  // namespace
 
 std::string textOf(const sim::Operation &operation) {
@@ -190,7 +199,7 @@ void Cluster::perform(const sim::Operation &operation) {
       if (Client *client = slot(a)) setCallback(*client, b);
       return;
     case Action::Read:
-      if (Client *client = slot(a)) read(*client);
+      if (Client *client = slot(a)) read(*client, b);
       return;
     case Action::Destroy:
       return destroy(a % clients);
@@ -355,16 +364,19 @@ void Cluster::setCallback(Client &client, uint8_t kind) {
   leave(client);
 }
 
-void Cluster::read(Client &client) {
+/* Kind 3 has room for one locator only. */
+void Cluster::read(Client &client, uint8_t kind) {
   if (!client.instance) return;
   enter(client);
   KARSTResolverNodeLocators set;
   std::memset(&set, canary, sizeof set);
-  set.capacity = KARST_RESOLVER_MAX_LOCATORS;
+  set.capacity = kind % 4 == 3 ? 1 : KARST_RESOLVER_MAX_LOCATORS;
   const size_t from = client.model->answers.size() - 1;
   const zel_Status status = functions_.getNodeLocators(client.instance, &set);
   if (status == ZEL_OK) {
-    lockstep_.saw(*client.model, from, model::Answer::of(KARST_RESOLVER_STATE_RESOLVED, set));
+    requireWithin(set);
+    if (set.capacity == KARST_RESOLVER_MAX_LOCATORS)
+      lockstep_.saw(*client.model, from, model::Answer::of(KARST_RESOLVER_STATE_RESOLVED, set));
   } else {
     if (status != ZEL_NOT_FOUND || reinterpret_cast<const uint8_t *>(&set)[0] != canary)
       host::panic("a read that finds nothing returns 0x%x or writes", status);
@@ -429,6 +441,7 @@ void Cluster::rest() {
     requireQuiet();
   }
   if (!module_) return;
+  requireEnabled();
   if (lockstep_.resolver().refused) resync(); /* what found no slot then may find one now */
   touchNews();
   requireQuiet();
@@ -464,6 +477,15 @@ void Cluster::requireClientsTold() {
                   client->model->answers[client->lastTold].text().c_str(),
                   client->model->answers.back().text().c_str());
   }
+}
+
+/* The module has heard of the last change of the directory's status. */
+void Cluster::requireEnabled() {
+  simulation_.directory().setUsable(usable_); /* two actors may have overtaken each other */
+  simulation_.run();
+  if (lockstep_.resolver().enabled != usable_)
+    host::panic("the directory is %susable, and the module %senabled", usable_ ? "" : "not ",
+                usable_ ? "not " : "");
 }
 
 /* The module holds what the directory says, as far as it fits. */

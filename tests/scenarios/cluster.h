@@ -74,7 +74,7 @@ class Cluster {
   void enter(Client &client);
   void leave(Client &client);
   void setCallback(Client &client, uint8_t kind);
-  void read(Client &client);
+  void read(Client &client, uint8_t kind);
   void destroy(size_t slot);
   void destroyAll();
 
@@ -82,6 +82,7 @@ class Cluster {
   void resync();
   void touchNews();
   void requireQuiet();
+  void requireEnabled();
   void requireDirectoryTaken();
   void requireClientsTold();
   void requireTraces();

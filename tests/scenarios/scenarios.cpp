@@ -84,6 +84,52 @@ std::vector<Operation> smallScript(std::initializer_list<Operation> overlapping)
 
 /* ---- The table ------------------------------------------------------------------------------- */
 
+/* Phase 1 prepares, phase 2 is searched. */
+Profile smallProfile(const char *name, const char *about, std::vector<Operation> script) {
+  const Actor first{"first", 1, {}}, second{"second", 1, {}};
+  return {.name = name,
+          .about = about,
+          .actors = {first, second},
+          .preemption = false,
+          .script = std::move(script)};
+}
+
+/* Each has a window in its middle that was open once, or could be. */
+std::vector<Profile> smallProfiles() {
+  const Operation makeForNode = doing(1, 0, Action::Create, 0, 2);
+  const Operation makeForObject = doing(1, 0, Action::Create, 0, 10);
+  const Operation listen = doing(1, 0, Action::SetCallback, 0, 1);
+  std::vector<Profile> table;
+  const auto add = [&](const char *name, const char *about, std::vector<Operation> script) {
+    table.push_back(smallProfile(name, about, std::move(script)));
+  };
+  add("small-destroy", "an instance is destroyed while its node changes",
+      smallScript({makeForNode, listen, doing(2, 0, Action::Destroy, 0),
+                   doing(2, 1, Action::PutNetIf, 2, 2, 2)}));
+  add("small-move", "an object moves while its node changes and its instance is read",
+      smallScript({makeForObject, listen, doing(2, 0, Action::PutObject, 2, 1),
+                   doing(2, 0, Action::Read, 0), doing(2, 1, Action::PutHealth, 2, 1)}));
+  add("small-unload", "the module goes while the directory is interrupted",
+      smallScript({makeForObject, doing(2, 0, Action::Unload), doing(2, 1, Action::Interrupt)}));
+  add("small-storm", "an interruption while an instance is made",
+      smallScript({doing(2, 0, Action::Create, 0, 1), doing(2, 1, Action::Interrupt)}));
+  add("small-object", "an object goes while its instance is made",
+      smallScript({doing(2, 0, Action::Create, 0, 10), doing(2, 1, Action::RemoveObject, 2)}));
+  add("small-health", "a health entry goes while its interface is new",
+      smallScript({doing(1, 0, Action::PutHealth, 3, 0), doing(2, 0, Action::PutNetIf, 3, 2, 1),
+                   doing(2, 1, Action::RemoveHealth, 3)}));
+  add("small-self", "a node is made during an enable",
+      smallScript({doing(1, 0, Action::Unusable), doing(2, 0, Action::Usable),
+                   doing(2, 1, Action::Create, 0, 1, 2)}));
+  add("small-outage", "a node goes while the directory is interrupted",
+      smallScript({makeForNode, listen, doing(2, 0, Action::Interrupt),
+                   doing(2, 1, Action::RemoveNode, 2)}));
+  add("small-return", "an object goes and comes back while the directory is interrupted",
+      smallScript({makeForObject, listen, doing(2, 0, Action::Interrupt),
+                   doing(2, 1, Action::RemoveObject, 2), doing(2, 1, Action::PutObject, 2, 2)}));
+  return table;
+}
+
 std::vector<Profile> profiles() {
   const Actor nodes{"nodes", 3, nodeEvents}, netIfs{"interfaces", 4, netIfEvents},
       objects{"objects", 3, objectEvents}, one{"caller-1", 4, callers}, two{"caller-2", 4, callers},
@@ -128,35 +174,7 @@ std::vector<Profile> profiles() {
                    .length = 200,
                    .faults = 6});
 
-  const Actor first{"first", 1, {}}, second{"second", 1, {}};
-  table.push_back({.name = "small-destroy",
-                   .about = "an instance is destroyed while its node changes",
-                   .actors = {first, second},
-                   .preemption = false,
-                   .script = smallScript(
-                       {doing(1, 0, Action::Create, 0, 1), doing(1, 0, Action::SetCallback, 0, 1),
-                        doing(2, 0, Action::Destroy, 0), doing(2, 1, Action::PutNetIf, 1, 1, 2)})});
-  table.push_back({.name = "small-move",
-                   .about = "an object moves while its node changes and its instance is read",
-                   .actors = {first, second},
-                   .preemption = false,
-                   .script = smallScript(
-                       {doing(1, 0, Action::Create, 0, 9), doing(1, 0, Action::SetCallback, 0, 1),
-                        doing(2, 0, Action::PutObject, 1, 2), doing(2, 0, Action::Read, 0),
-                        doing(2, 1, Action::PutHealth, 1, 1)})});
-  table.push_back(
-      {.name = "small-unload",
-       .about = "the module goes while the directory is interrupted",
-       .actors = {first, second},
-       .preemption = false,
-       .script = smallScript({doing(1, 0, Action::Create, 0, 9), doing(2, 0, Action::Unload),
-                              doing(2, 1, Action::Interrupt)})});
-  table.push_back(
-      {.name = "small-storm",
-       .about = "an interruption while an instance is made",
-       .actors = {first, second},
-       .preemption = false,
-       .script = smallScript({doing(2, 0, Action::Create, 0, 1), doing(2, 1, Action::Interrupt)})});
+  for (Profile &small : smallProfiles()) table.push_back(std::move(small));
   return table;
 }
 

@@ -12,23 +12,15 @@ struct ModuleTest::Functions {
   decltype(KARSTResolver_GetNodeLocators) *getNodeLocators;
 };
 
-std::string textOf(const KARSTResolverNodeLocator &locator) {
-  char text[INET6_ADDRSTRLEN] = "";
-  switch (locator.networkType) {
-    case KARST_RESOLVER_LOCATOR_IPV4:
-      return inet_ntop(AF_INET, locator.address, text, sizeof text);
-    case KARST_RESOLVER_LOCATOR_IPV6:
-      return inet_ntop(AF_INET6, locator.address, text, sizeof text);
-    case KARST_RESOLVER_LOCATOR_LOCAL:
-      return "local";
-    default:
-      return "network type " + std::to_string(locator.networkType);
-  }
-}
-
 std::vector<std::string> textsOf(const KARSTResolverNodeLocators &set) {
   std::vector<std::string> texts;
-  for (uint16_t i = 0; i < set.count; i++) texts.push_back(textOf(set.locators[i]));
+  for (uint16_t i = 0; i < set.count; i++) {
+    const KARSTResolverNodeLocator &locator = set.locators[i];
+    const bool isIPv6 = locator.networkType == KARST_RESOLVER_LOCATOR_IPV6;
+    char text[INET6_ADDRSTRLEN] = "";
+    EXPECT_TRUE(isIPv6 || locator.networkType == KARST_RESOLVER_LOCATOR_IPV4);
+    texts.emplace_back(inet_ntop(isIPv6 ? AF_INET6 : AF_INET, locator.address, text, sizeof text));
+  }
   return texts;
 }
 
@@ -182,12 +174,6 @@ void ModuleTest::destroy(Client &client) {
 
 zel_Status ModuleTest::read(const Client &client, KARSTResolverNodeLocators *set) {
   return sim.call("client", [&] { return functions_->getNodeLocators(client.instance, set); });
-}
-
-std::vector<std::string> ModuleTest::addresses(const Client &client) {
-  KARSTResolverNodeLocators set{};
-  set.capacity = KARST_RESOLVER_MAX_LOCATORS;
-  return read(client, &set) == ZEL_OK ? textsOf(set) : std::vector<std::string>{};
 }
 
 /* ---- Inside ---------------------------------------------------------------------------------- */

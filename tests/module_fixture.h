@@ -18,8 +18,7 @@
 #include "sim/simulation.h"
 #include "tests/uuids.h"
 
-/* An address of a locator, as text: "10.0.0.1", "fd00::1", "local". */
-std::string textOf(const KARSTResolverNodeLocator &locator);
+/* The addresses of locators: "10.0.0.1", "fd00::1". */
 std::vector<std::string> textsOf(const KARSTResolverNodeLocators &set);
 
 /* A client: an instance and what its callback was told. */
@@ -76,7 +75,6 @@ class ModuleTest : public ::testing::Test {
   void removeCallback(Client &client);
   void destroy(Client &client);
   zel_Status read(const Client &client, KARSTResolverNodeLocators *set);
-  std::vector<std::string> addresses(const Client &client); /* empty: not resolved */
 
   /* ---- Inside -------------------------------------------------------------------------------- */
 

@@ -1,5 +1,4 @@
-/* Loading and unloading; the module's memory; what it declares. */
-#include "host/kernel/module_file.h"
+/* Loading and unloading; the module's memory. */
 #include "platform/tolm.h"
 #include "tests/module_fixture.h"
 
@@ -180,37 +179,6 @@ TEST_F(Memory, ReallocStopsTheSystem) {
   auto *pool = static_cast<const KARSTMemPool *>(module().anySymbol("karstResolverMemPool"));
   EXPECT_DEATH(sim.call("caller", [&] { pool->realloc(nullptr, nullptr, 1); }),
                "Failed at karst_resolver/karst_resolver_util:[0-9]+ -- NOT REACHED");
-}
-
-/* ---- Declaration ----------------------------------------------------------------------------- */
-
-TEST(Declaration, IsTheOneAgreedUpon) {
-  host::ModuleFile file(KARST_RESOLVER_SO);
-  EXPECT_THAT(
-      file.declaration,
-      ElementsAre("param_KARST_RESOLVER_LEAST_MAX_HEAP:int",
-                  "nsRequired=com.tarvik.tracing#0.0.0.1", "nsRequired=com.tarvik.qxt#0.0.0.1",
-                  "nsRequired=com.tarvik.tolmutil#0.0.0.1", "nsRequired=com.tarvik.karst#0.0.0.1",
-                  "nsProvides=com.tarvik.karst.resolver#0.0.0.1",
-                  "param_desc_KARST_RESOLVER_LEAST_MAX_HEAP=Min heap size in bytes (default: 10MB)",
-                  "nsRequired=com.tarvik.tolmapi#0.0.0.2", "nsRequired=com.tarvik.zelapi#v2_4_0_0",
-                  "nsRequired=com.tarvik.zelapi.incompat#v2_4_0_0"));
-  std::vector<std::string> required;
-  for (const host::Namespace &name : file.required)
-    required.push_back(name.name + "#" + name.version);
-  EXPECT_THAT(required, ElementsAre("com.tarvik.tracing#0.0.0.1", "com.tarvik.qxt#0.0.0.1",
-                                    "com.tarvik.tolmutil#0.0.0.1", "com.tarvik.karst#0.0.0.1",
-                                    "com.tarvik.tolmapi#0.0.0.2", "com.tarvik.zelapi#v2_4_0_0",
-                                    "com.tarvik.zelapi.incompat#v2_4_0_0"));
-  EXPECT_THAT(file.exports,
-              ElementsAre("KARSTResolver_GetNodeLocators", "KARSTResolver_SetCallback",
-                          "KARSTResolver_Destroy", "KARSTResolver_Create"));
-  ASSERT_EQ(file.parameters.size(), 1u);
-  EXPECT_EQ(file.parameters[0].name, "KARST_RESOLVER_LEAST_MAX_HEAP");
-  EXPECT_EQ(file.parameters[0].type, 1u);
-  ASSERT_EQ(file.assertions.size(), 1u);
-  EXPECT_EQ(file.assertions[0].kind, 1u);
-  EXPECT_EQ(file.assertions[0].source, "karst/karst_rbtree_impl");
 }
 
 }  // namespace

@@ -381,13 +381,13 @@ TEST(Failure, IsOfTheSameKindWhateverItsNumbers) {
 }
 
 TEST(Crew, ReportsWhatNeverEndsAndWhatCrashes) {
-  const auto failureOf = [](Toy::Body body) {
+  const auto failureOf = [](Toy::Body body, std::chrono::milliseconds patience = 60s) {
     const Toy toy("toy", body);
-    sim::Crew crew(1, 200ms);
+    sim::Crew crew(1, patience);
     const auto failure = crew.alone([&] { sim::play(sim::makeCase(toy, 1, {}, 0), {}); });
     return failure ? failure->message : "none";
   };
-  EXPECT_THAT(failureOf(&goInCircles), HasSubstr("no step within 0 seconds"));
+  EXPECT_THAT(failureOf(&goInCircles, 200ms), HasSubstr("no step within 0 seconds"));
   EXPECT_THAT(failureOf(&crash), testing::ContainsRegex("Segmentation fault|SEGV"));
   EXPECT_THAT(failureOf([](Machine &, const sim::Plan &) { throw std::runtime_error("no"); }),
               "exception: no");

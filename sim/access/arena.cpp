@@ -1,10 +1,18 @@
 /* The arena: where the next block goes, and what lies where. One OS thread, no lock. */
 #include "sim/access/arena.h"
 
+#include <cstring>
+
 #include "host/kernel/panic.h"
 #include "sim/access/reserve.h"
 
 namespace sim::access {
+
+namespace {
+
+constexpr int junk = 0xdb; /* fills new blocks: zeroes may be there by luck only */
+
+}  // namespace
 
 Arena::Arena(Listener &listener)
     : listener_(listener),
@@ -67,6 +75,7 @@ void *Arena::get(size_t front, size_t bytes) {
   block.base = base_ + offset + front;
   block.size = bytes;
   block.live = true;
+  std::memset(reinterpret_cast<void *>(base_ + offset), junk, front + bytes);
   listener_.given(block);
   return reinterpret_cast<void *>(base_ + offset);
 }

@@ -118,9 +118,9 @@ std::vector<Profile> smallProfiles() {
   add("small-health", "a health entry goes while its interface is new",
       smallScript({doing(1, 0, Action::PutHealth, 3, 0), doing(2, 0, Action::PutNetIf, 3, 2, 1),
                    doing(2, 1, Action::RemoveHealth, 3)}));
-  add("small-self", "a node is made during an enable",
-      smallScript({doing(1, 0, Action::Unusable), doing(2, 0, Action::Usable),
-                   doing(2, 1, Action::Create, 0, 1, 2)}));
+  add("small-self", "a node is made during the first enable, which learns who this host is",
+      {doing(0, 0, Action::PutNode, 1), doing(0, 0, Action::Load), doing(2, 0, Action::Usable),
+       doing(2, 1, Action::Create, 0, 1, 2)});
   add("small-outage", "a node goes while the directory is interrupted",
       smallScript({makeForNode, listen, doing(2, 0, Action::Interrupt),
                    doing(2, 1, Action::RemoveNode, 2)}));
@@ -292,9 +292,10 @@ Plan Tabled::plan(uint64_t seed, size_t length) const {
     operation.phase = static_cast<uint8_t>(1 + i * profile_.phases / length);
     plan.operations.push_back(operation);
   }
+  /* Among the first uses as often as among many: some calls are made a few times only. */
   for (size_t i = profile_.faults ? random.below(profile_.faults + 1) : 0; i > 0; i--)
     plan.faults.push_back({faultable[random.below(std::size(faultable))],
-                           static_cast<uint32_t>(1 + random.below(200)),
+                           static_cast<uint32_t>(1 + random.below(size_t{4} << random.below(6))),
                            static_cast<uint32_t>(1 + random.below(4))});
   return plan;
 }

@@ -37,7 +37,7 @@ sim: ## search schedules and failures, SIM_STEPS (600e6) of them with every acce
 
 mutants: ## plant faults one by one; each must be found
 	tools/install-deps build test
-	tools/mutants
+	tools/mutants $(MUTANTS)
 
 fuzz: ## throw bytes at every reader, FUZZ_SECONDS (60) each
 	tools/install-deps build test fuzz

@@ -70,6 +70,8 @@ zel_Status CallbackTable::callSubscriber(void *record, const KarstEntryHeader *h
   machine.note("subscription is called",
                Argument::entry(call.type, header ? header->uuid : zel_UUID{}), status);
   const zel_Status result = call.fn(call.data, header, argument, status);
+  /* On its way out of the last call: this is where the module's code may be unmapped too early. */
+  if (status == ZEL_SUB_CANCELLED) machine.scheduler().point();
   machine.note("subscription returns", {});
   requireNoSpinlock(fiber, "returns from a subscription's callback");
   access::publish(&subscription);

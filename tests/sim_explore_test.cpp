@@ -413,7 +413,7 @@ Answer command(const std::string &options) {
   testing::internal::CaptureStdout();
   testing::internal::CaptureStderr();
   const int status =
-      sim::explore(static_cast<int>(arguments.size()), arguments.data(), std::move(scenarios),
+      sim::explore(static_cast<int>(arguments.size()), arguments.data(), scenarios,
                    {.program = "toys", .watched = "watched.so", .plain = "plain.so"});
   const std::string errors = testing::internal::GetCapturedStderr();
   return {status, testing::internal::GetCapturedStdout() + errors};

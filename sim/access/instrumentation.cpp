@@ -77,6 +77,8 @@ bool compareExchange(volatile Value *memory, Value *expected, Value desired, int
 
 extern "C" {
 
+/* The names are the compiler's. NOLINTBEGIN(bugprone-reserved-identifier) */
+
 /* ---- Functions ------------------------------------------------------------------------------- */
 
 /* Called when the object is mapped, before anything in it runs. */
@@ -227,5 +229,7 @@ void __tsan_atomic_thread_fence(int order) {
   watching->fence(order);
 }
 void __tsan_atomic_signal_fence(int) {}
+
+/* NOLINTEND(bugprone-reserved-identifier) */
 
 }  // extern "C"

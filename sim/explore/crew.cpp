@@ -78,7 +78,7 @@ void keepMemory() {
 }
 
 void watch(std::chrono::milliseconds patience) {
-  static std::array<char, 512 * 1024> stack;
+  static std::array<char, size_t{512} * 1024> stack;
   const stack_t alternative{.ss_sp = stack.data(), .ss_flags = 0, .ss_size = stack.size()};
   sigaltstack(&alternative, nullptr);
 

@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <chrono>
+#include <cmath>
 #include <cstdio>
 #include <fstream>
 #include <nlohmann/json.hpp>
@@ -29,7 +30,7 @@ constexpr size_t reportLines = 300;               /* of what happened */
 constexpr size_t reportHistory = size_t{1} << 18; /* calls, so that locks held are followed */
 
 unsigned long long wide(double number) {
-  return static_cast<unsigned long long>(number + 0.5);
+  return static_cast<unsigned long long>(std::llround(number));
 }
 
 /* "12.3 M": short enough for a line of progress. */
@@ -428,7 +429,7 @@ void Explorer::writeJson(const std::optional<Found> &found) const {
 
 }  // namespace
 
-int explore(int argc, char **argv, std::vector<std::unique_ptr<Scenario>> scenarios,
+int explore(int argc, char **argv, const std::vector<std::unique_ptr<Scenario>> &scenarios,
             const ExploreDefaults &defaults) {
   try {
     const std::optional<Options> options = parseOptions(argc, argv, defaults);

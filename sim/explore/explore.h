@@ -18,7 +18,7 @@ struct ExploreDefaults {
 /* The whole command: reads its options, searches, shortens and reports. Gives the exit status: 0
  * nothing was found, 1 a failure was, 2 the command line is wrong, 130 interrupted before the first
  * run had ended. Standard output has the results, standard error the progress. */
-int explore(int argc, char **argv, std::vector<std::unique_ptr<Scenario>> scenarios,
+int explore(int argc, char **argv, const std::vector<std::unique_ptr<Scenario>> &scenarios,
             const ExploreDefaults &defaults);
 
 }  // namespace sim

@@ -72,7 +72,7 @@ Task Machine::spawn(const std::string &name, std::function<void()> body) {
     *ended = true;
   });
   access::passOn(fiber);
-  return Task(std::move(ended));
+  return Task(ended);
 }
 
 void Machine::run() {

@@ -24,6 +24,8 @@ using namespace sim;
 
 namespace {
 
+constexpr size_t pointerSize = sizeof(void *);
+
 host::Directory &directory() {
   return Simulation::current().directory();
 }
@@ -42,7 +44,7 @@ void report(PlatformCall &call, const Lookup &lookup) {
 
 /* The directory has stored a whole entry in a block of the caller's, and where that is. */
 void noteWhole(KarstFullEntry *const *entry) {
-  access::noteWrite(entry, sizeof *entry);
+  access::noteWrite(entry, pointerSize);
   access::noteWrite(*entry, sizeof **entry + (*entry)->header.dataLength);
 }
 
@@ -137,13 +139,13 @@ extern "C" zel_Status Tolm_LogInit(const char *name, zel_ModuleID moduleID, uint
   PlatformCall call(Call::Tolm_LogInit, Argument::text(name));
   if (call.fault()) return call.fault();
   const zel_Status status = host::logOpen(name, moduleID, level, log);
-  if (status == ZEL_OK) access::noteWrite(log, sizeof *log);
+  if (status == ZEL_OK) access::noteWrite(log, pointerSize);
   return call.returns(status);
 }
 
 extern "C" void Tolm_LogCleanup(zel_Log **log) {
   PlatformCall call(Call::Tolm_LogCleanup);
-  access::noteWrite(log, sizeof *log);
+  access::noteWrite(log, pointerSize);
   host::logClose(log);
 }
 

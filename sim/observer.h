@@ -47,7 +47,6 @@ class Observer {
   virtual void toldSelf(Fiber &, const zel_UUID &) {}
 
   virtual void subscribed(Fiber &, const KarstQuery &, void * /*data*/, zel_Status) {}
-  virtual void unsubscribing(Fiber &, const KarstQuery &, void * /*data*/) {}
   virtual void subscriptionCalls(Fiber &, const SubscriptionCall &) {}
   virtual void subscriptionReturned(Fiber &, const SubscriptionCall &) {}
 
@@ -56,7 +55,6 @@ class Observer {
   virtual void statusReturned(Fiber &, uint32_t /*status*/) {}
 
   virtual void worldCreated(Fiber &, zel_Status) {}
-  virtual void worldEnded(Fiber & /*who waited for it*/) {}
   virtual void worldWaited(Fiber &, zel_Status) {}
   virtual void preemptionAnswered(Fiber &, bool) {}
 };

@@ -213,8 +213,6 @@ extern "C" zel_Status KARST_Subscribe(const KarstQuery *query, KarstSubscription
 extern "C" void KARST_Unsubscribe(const KarstQuery *query, KarstSubscriptionFn fn, void *data) {
   PlatformCall call(Call::KARST_Unsubscribe, subjectOf(*query));
   access::noteRead(query, sizeof *query);
-  if (Observer *observer = call.machine().observer())
-    observer->unsubscribing(call.fiber(), *query, data);
   call.machine().callbacks().unsubscribe(directory(), query, fn, data);
 }
 

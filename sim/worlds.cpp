@@ -153,7 +153,6 @@ extern "C" void TOLM_WorldDestroy(zel_WorldID *world) {
   access::forget(&ending.end);
   ending.~World();
   host::heapFree(heap, &ending);
-  if (Observer *observer = machine.observer()) observer->worldEnded(call.fiber());
 }
 
 extern "C" zel_Status zel_WorldWait(uint64_t event, zel_SpinlockHandle lock, uint32_t timeout,

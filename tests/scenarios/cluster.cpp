@@ -9,6 +9,7 @@
 #include "host/kernel/log.h"
 #include "host/kernel/panic.h"
 #include "host/tracing/tracing.h"
+#include "karst_resolver/trace.h"
 #include "sim/lock_order.h"
 #include "tests/directory_view.h"
 #include "tests/scenarios/actions.h"
@@ -20,22 +21,6 @@ namespace {
 constexpr uint32_t nudgeNode = 200; /* comes and goes to wake the world; no scenario uses it */
 constexpr uint32_t firstOfFlood = 1000;
 constexpr uint8_t canary = 0xa5;
-
-/* Trace ids that are counted; the numbers are part of the record's format. */
-enum TraceID {
-  CreateInstance = 1,
-  DestroyInstance = 2,
-  UpdateAddresses = 6,
-  InvokeCallback = 7,
-  AddNetIf = 8,
-  RemoveNetIf = 9,
-  AddNode = 12,
-  RemoveNode = 13,
-  RescanNetIfs = 15,
-  RescanNodes = 16,
-  SetCallback = 17,
-  ReleaseInstance = 18,
-};
 
 /* The host reports, and does not mind, what a heap or a lock domain still holds at its end. */
 void leftBehind(const std::string &report) {
@@ -144,11 +129,7 @@ void Cluster::unload() {
 
 void Cluster::close() {
   simulation_.clearFaults();
-  simulation_.spawn("unloader", [this] {
-    if (module_ && !unloading_) {
-      unload();
-    }
-  });
+  simulation_.spawn("unloader", [this] { unload(); });
   simulation_.run();
   if (module_) host::panic("the module is still there");
 }
@@ -345,7 +326,6 @@ void Cluster::told(Client &client, KARSTResolverInstance *instance,
     if (answer.major < client.lastMajor) host::panic("an older version is told after a newer one");
     client.lastMajor = answer.major;
   }
-  client.told = true;
   ++client.callbacks;
   ++callbacks_;
   for (unsigned i = 0; i < client.work; i++) simulation_.scheduler().point();
@@ -510,6 +490,9 @@ void Cluster::requireDirectoryTaken() {
   host::panic("the module and the directory differ:%s", text.c_str());
 }
 
+/* How often an event was traced. */
+#define TRACED(event) traced_[KARST_RESOLVER_TRACE_ID_##event]
+
 /* Each kind of event, counted from the start, agrees with what has happened. */
 void Cluster::requireTraces() {
   for (const host::TracedRecord &record : host::readTrace()) {
@@ -517,7 +500,8 @@ void Cluster::requireTraces() {
     if (record.sequence != traceSeen_) host::panic("the trace ring is too small for this run");
     ++traceSeen_;
     ++traced_[record.id % std::size(traced_)];
-    if (record.id == ReleaseInstance && record.payload[1] == 1) ++freedInstances_;
+    if (record.id == KARST_RESOLVER_TRACE_ID_ReleaseInstance && record.payload[1] == 1)
+      ++freedInstances_;
   }
   const auto require = [&](const char *what, uint64_t counted, uint64_t wanted) {
     if (counted != wanted)
@@ -527,16 +511,16 @@ void Cluster::requireTraces() {
   };
   const Lockstep::Counts &counts = lockstep_.counts();
   const bool there = lockstep_.cache() != nullptr;
-  require("nodes", traced_[AddNode] - traced_[RemoveNode],
+  require("nodes", TRACED(AddNodeToCache) - TRACED(RemoveNodeFromCache),
           there ? lockstep_.resolver().nodes.size() : 0);
-  require("interfaces", traced_[AddNetIf] - traced_[RemoveNetIf],
+  require("interfaces", TRACED(AddNetIfToCache) - TRACED(RemoveNetIfFromCache),
           there ? lockstep_.resolver().netIfs.size() : 0);
-  require("created instances", traced_[CreateInstance], counts.creates);
-  require("destroyed instances", traced_[DestroyInstance], counts.destroys);
-  require("instances", traced_[CreateInstance] - freedInstances_, counts.creates - counts.destroys);
-  require("answers", traced_[UpdateAddresses], counts.answers);
-  require("callbacks", traced_[InvokeCallback], callbacks_);
-  require("callbacks set", traced_[SetCallback], callbackCalls_);
-  require("rescans of nodes", traced_[RescanNodes], counts.nodeRescans);
-  require("rescans of interfaces", traced_[RescanNetIfs], counts.netIfRescans);
+  require("created instances", TRACED(CreateInstance), counts.creates);
+  require("destroyed instances", TRACED(DestroyInstance), counts.destroys);
+  require("instances", TRACED(CreateInstance) - freedInstances_, counts.creates - counts.destroys);
+  require("answers", TRACED(UpdateAddresses), counts.answers);
+  require("callbacks", TRACED(InvokeCallback), callbacks_);
+  require("callbacks set", TRACED(SetCallback), callbackCalls_);
+  require("rescans of nodes", TRACED(RescanNodes), counts.nodeRescans);
+  require("rescans of interfaces", TRACED(RescanNetIfs), counts.netIfRescans);
 }

@@ -51,7 +51,6 @@ class Cluster {
     sim::HandOver made, used; /* from its maker to its users, and from these to its end */
     bool destroyed = false;
     bool hasCallback = false;
-    bool told = false; /* since the callback was set */
     uint64_t callbacks = 0;
     size_t lastTold = 0; /* in the model's answers */
     uint32_t lastMajor = 0;

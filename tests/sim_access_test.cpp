@@ -19,6 +19,7 @@
 #include "sim/lock_order.h"
 #include "sim/simulation.h"
 #include "tests/sim_access_subject.h"
+#include "tests/sim_heap.h"
 
 namespace {
 
@@ -53,44 +54,11 @@ void get() {
   subject::load(&shared[0]);
 }
 
-/* A heap, a domain and blocks, as a module has them. */
-struct Heap {
-  Heap() {
-    zel_HeapProps props{};
-    host::fillName(&props.name, "test");
-    props.maximumSize = 1 << 20;
-    EXPECT_EQ(zel_HeapCreate(&props, &id), ZEL_OK);
-    EXPECT_EQ(zel_LockDomainCreate(0, id, &props.name, &domain), ZEL_OK);
-  }
-  ~Heap() {
-    zel_LockDomainDestroy(domain);
-    zel_HeapDestroy(id);
-  }
-  uint64_t *get(uint32_t size) {
-    return static_cast<uint64_t *>(zel_HeapAllocWithRA(id, size, nullptr));
-  }
-  void put(void *block) { zel_HeapFree(id, block); }
-  zel_SpinlockHandle lock(const char *name, uint16_t rank) {
-    zel_SpinlockProps props{};
-    host::fillName(&props.name, name);
-    props.heap = id;
-    props.type = ZEL_SPINLOCK_RANKED;
-    props.domain = domain;
-    props.rank = rank;
-    zel_SpinlockHandle handle = ZEL_NO_SPINLOCK;
-    EXPECT_EQ(zel_SpinlockCreate(&props, &handle), ZEL_OK);
-    return handle;
-  }
-
-  zel_HeapID id = ZEL_NO_HEAP;
-  zel_LockDomainID domain = ZEL_NO_LOCK_DOMAIN;
-};
-
 /* A machine that is watched, with a heap. */
 struct Bench {
   Machine machine;
   sim::access::Recorder &recorder = machine.watch();
-  Heap heap;
+  SimHeap heap;
 };
 
 /* ---- Races ----------------------------------------------------------------------------------- */
@@ -200,7 +168,6 @@ TEST(Order, ComesFromALockFromAHandOverAndFromSpawning) {
   bench.machine.run();
   bench.machine.call("c", locked(put));
   bench.machine.call("d", get); /* c's end, the driver, d's beginning */
-  zel_SpinlockDestroy(lock);
 
   sim::HandOver hand;
   bench.machine.spawn("giver", [&] {
@@ -519,7 +486,6 @@ TEST(Rules, KeepFreeSlotsUntouched) {
     subject::fill(&pool[0], sizeof(Slot));
     subject::store(&pool[0].value, 1);
   });
-  zel_SpinlockDestroy(lock);
   bench.heap.put(pool);
 }
 
@@ -588,7 +554,6 @@ TEST(Rules, AskForTheGuardOfAFieldOnceTheObjectIsShared) {
   with({}, [=] { subject::storeThrough(&thing->own, 1); });
 
   bench.heap.put(thing);
-  for (const zel_SpinlockHandle lock : {outer, own, other}) zel_SpinlockDestroy(lock);
 }
 
 TEST(Rules, AreNotTakenWithoutReasons) {
@@ -615,7 +580,6 @@ void nest(const std::vector<const char *> &names) {
     for (const zel_SpinlockHandle lock : locks) zel_SpinlockLock(lock);
     for (const zel_SpinlockHandle lock : locks) zel_SpinlockUnlock(lock);
   });
-  for (const zel_SpinlockHandle lock : locks) zel_SpinlockDestroy(lock);
 }
 
 TEST(LockOrder, ACircleOverSeveralRunsIsFound) {
@@ -641,8 +605,6 @@ TEST(LockOrder, CountsWhatElseIsWaitedFor) {
       }
       zel_SpinlockUnlock(lock);
     });
-    zel_SpinlockDestroy(lock);
-    zel_SpinlockDestroy(second);
   };
   inCallback(false);
   EXPECT_DEATH(inCallback(true), HasSubstr("instance inside \"instance\""));
@@ -650,7 +612,7 @@ TEST(LockOrder, CountsWhatElseIsWaitedFor) {
   const auto stopping = [](bool crosswise) {
     Simulation sim;
     sim.watch();
-    Heap heap;
+    SimHeap heap;
     static zel_WorldID world;
     static bool deregisters;
     deregisters = crosswise;

@@ -19,6 +19,7 @@
 #include "host/threads/worlds.h"
 #include "platform/tolm.h"
 #include "sim/machine.h"
+#include "tests/sim_heap.h"
 
 namespace {
 
@@ -27,36 +28,6 @@ using sim::Call;
 using sim::Machine;
 using sim::Switching;
 using testing::ElementsAre;
-
-/* A heap, a lock domain and locks, as a module has them. */
-struct Locks {
-  Locks() {
-    zel_HeapProps props{};
-    host::fillName(&props.name, "test");
-    props.maximumSize = 1 << 20;
-    EXPECT_EQ(zel_HeapCreate(&props, &heap), ZEL_OK);
-    EXPECT_EQ(zel_LockDomainCreate(0, heap, &props.name, &domain), ZEL_OK);
-  }
-  ~Locks() {
-    for (const zel_SpinlockHandle lock : made) zel_SpinlockDestroy(lock);
-    zel_LockDomainDestroy(domain);
-    zel_HeapDestroy(heap);
-  }
-  zel_SpinlockHandle make(const char *name, uint16_t rank) {
-    zel_SpinlockProps props{};
-    host::fillName(&props.name, name);
-    props.heap = heap;
-    props.type = ZEL_SPINLOCK_RANKED;
-    props.domain = domain;
-    props.rank = rank;
-    EXPECT_EQ(zel_SpinlockCreate(&props, &made.emplace_back()), ZEL_OK);
-    return made.back();
-  }
-
-  zel_HeapID heap = ZEL_NO_HEAP;
-  zel_LockDomainID domain = ZEL_NO_LOCK_DOMAIN;
-  std::vector<zel_SpinlockHandle> made;
-};
 
 /* A world that does `work` whenever it is woken, as a module's world would. */
 struct Worker {
@@ -83,8 +54,8 @@ struct Worker {
 std::pair<uint64_t, std::string> playThrough(uint64_t seed) {
   Machine machine({.seed = seed, .switching = Switching::Random});
   std::string order;
-  Locks locks;
-  const zel_SpinlockHandle lock = locks.make("queue", 1);
+  SimHeap heap;
+  const zel_SpinlockHandle lock = heap.lock("queue", 1);
   int inside = 0, due = 0, served = 0;
   Worker server{[&] {
     zel_SpinlockLock(lock);
@@ -93,7 +64,7 @@ std::pair<uint64_t, std::string> playThrough(uint64_t seed) {
     --inside;
     zel_SpinlockUnlock(lock);
   }};
-  server.start(locks.heap);
+  server.start(heap.id);
   for (const char name : {'a', 'b', 'c'}) {
     machine.spawn(std::string(1, name), [&, name] {
       for (int i = 0; i < 5; ++i) {
@@ -131,8 +102,8 @@ TEST(Switching, StepsLeadFromPointToPointAndAnyWaiterMayBeNext) {
   std::set<std::string> orders;
   for (uint64_t seed = 1; seed <= 200; ++seed) {
     Machine machine;
-    Locks locks;
-    const zel_SpinlockHandle lock = locks.make("shared", 1);
+    SimHeap heap;
+    const zel_SpinlockHandle lock = heap.lock("shared", 1);
     std::string order;
     zel_SpinlockLock(lock);
     for (const char name : {'a', 'b', 'c'}) {
@@ -156,9 +127,9 @@ TEST(Switching, StepsLeadFromPointToPointAndAnyWaiterMayBeNext) {
 /* Where mistakes are made: on a fiber "culprit", with lock a of rank 1 and b of rank 2. */
 struct Scene {
   Machine machine{{.stepLimit = 200}};
-  Locks locks;
-  zel_SpinlockHandle a = locks.make("lock a", 1);
-  zel_SpinlockHandle b = locks.make("lock b", 2);
+  SimHeap heap;
+  zel_SpinlockHandle a = heap.lock("lock a", 1);
+  zel_SpinlockHandle b = heap.lock("lock b", 2);
   host::Mutex mutex;
 
   void commit(void (*mistake)(Scene &)) {
@@ -197,7 +168,7 @@ TEST(FatalDeathTest, SaysWhoDidWhat) {
       {[](Scene &s) { zel_SpinlockLock(s.a), zel_WorldSleep(1); },
        "culprit calls zel_WorldSleep while it holds spinlock \"lock a\""},
       {[](Scene &s) { zel_SpinlockLock(s.a); }, "culprit ends while it holds spinlock \"lock a\""},
-      {[](Scene &) { (new Locks)->make("forgotten", 1); },
+      {[](Scene &) { (new SimHeap)->lock("forgotten", 1); },
        "left behind at the end of the simulation:\n  lock domain test\n"
        "  lock forgotten in domain test\n  heap test: 2 blocks"},
       {embrace,
@@ -307,10 +278,10 @@ TEST(World, KeepsAWakeUpOnceAndStopsInEveryState) {
   for (const uint64_t steps : {0u, 1u, 2u}) {
     for (const bool stop : {false, true}) {
       Machine machine;
-      Locks locks;
+      SimHeap heap;
       int wakeUps = 0;
       Worker worker{[&] { ++wakeUps; }};
-      EXPECT_EQ(worker.start(locks.heap), ZEL_OK);
+      EXPECT_EQ(worker.start(heap.id), ZEL_OK);
       machine.step(steps);
       machine.hold("worker");
       zel_WorldForceWakeup(worker.id);
@@ -329,7 +300,7 @@ TEST(World, KeepsAWakeUpOnceAndStopsInEveryState) {
 
 TEST(World, WaitsNoLongerThanItsTimeOutAndNeverGivesWayTwiceRunning) {
   Machine machine;
-  Locks locks;
+  SimHeap heap;
   Worker worker;
   std::string answers;
   worker.work = [&] {
@@ -338,7 +309,7 @@ TEST(World, WaitsNoLongerThanItsTimeOutAndNeverGivesWayTwiceRunning) {
     EXPECT_EQ(zel_GetTimerCycles() - start, 20'000'000u);
     for (int i = 0; i < 8; ++i) answers += tolmapi_PreemptionIsPending() ? 'y' : 'n';
   };
-  worker.start(locks.heap);
+  worker.start(heap.id);
   machine.forcePreemption(3);
   zel_WorldForceWakeup(worker.id);
   machine.run();
@@ -350,12 +321,12 @@ TEST(World, WaitsNoLongerThanItsTimeOutAndNeverGivesWayTwiceRunning) {
 
 TEST(Faults, ComeAtExactlyTheUseAsked) {
   Machine machine;
-  Locks locks;
+  SimHeap heap;
   const auto allocate = [&](int times) {
     std::string got;
     for (int i = 0; i < times; ++i) {
-      void *block = zel_HeapAllocWithRA(locks.heap, 8, nullptr);
-      zel_HeapFree(locks.heap, block);
+      void *block = zel_HeapAllocWithRA(heap.id, 8, nullptr);
+      zel_HeapFree(heap.id, block);
       got += block ? '+' : '-';
     }
     return got;

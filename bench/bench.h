@@ -1,89 +1,78 @@
-/* What the benchmarks share: how work and peers are named, and the host kernel with the resolver
- * loaded. Used by the main thread; only WatchedNode's callbacks come on the resolver's own. */
+/* What the benchmarks share: how work, peers and limits are named, what is asked of our figures, and
+ * which processor runs what. Google Benchmark runs them; figures.h keeps what they say. */
 #pragma once
 
 #include <benchmark/benchmark.h>
 
-#include <atomic>
 #include <chrono>
 #include <cstdint>
 #include <string>
 #include <vector>
 
-#include "host/host_kernel.h"
-#include "karst_resolver/karst_resolver.h"
-
 namespace bench {
 
 using Clock = std::chrono::steady_clock;
 
-inline const std::string OURS = "ours", SEPARATOR = " | ";
+inline const std::string OURS = "ours";
 
-/* A benchmark whose time is that of so many pieces of work sets this counter. */
-inline constexpr const char *ITEMS = "items";
+/* ---- What is measured ------------------------------------------------------------------------ */
 
-/* `who` is OURS or a peer's name; what has the same `work` is compared. */
+/* What has the same `work` is compared; `who` is OURS or a peer's name. */
+struct Subject {
+  std::string work, who = OURS;
+  auto operator<=>(const Subject &) const = default;
+};
+
+/* As the benchmark library knows the subject; remembers its place in the order of the table. */
+std::string nameOf(const Subject &subject);
+
+/* Function takes a benchmark::State. All subjects run in one process, their repetitions in random
+ * order, so that what disturbs the machine disturbs all of them. */
 template <typename Function>
-benchmark::internal::Benchmark *measure(const std::string &work, const std::string &who,
-                                        Function function) {
-  return benchmark::RegisterBenchmark((work + SEPARATOR + who).c_str(), function);
+benchmark::internal::Benchmark *measure(const Subject &subject, Function function) {
+  return benchmark::RegisterBenchmark(nameOf(subject).c_str(), function);
 }
 
-struct Cluster {
-  Cluster(); /* throws host::ModuleError */
+/* The name of a subject that is no peer but the least that the machine allows. */
+inline std::string limit(const std::string &what) {
+  return "limit: " + what;
+}
 
-  /* What the module has by this name, exported or not: the code as it is shipped. Throws
-   * std::runtime_error. */
-  template <typename Type>
-  Type *inModule(const char *name) const {
-    return reinterpret_cast<Type *>(symbol(name));
-  }
+/* A benchmark whose time is that of so many pieces of work sets this counter: figures are for one. */
+inline constexpr const char *ITEMS = "items";
 
-  host::Kernel kernel;
-  host::Module &module;
-  decltype(KARSTResolver_Create) *const create;
-  decltype(KARSTResolver_Destroy) *const destroy;
-  decltype(KARSTResolver_SetCallback) *const setCallback;
-  decltype(KARSTResolver_GetNodeLocators) *const getNodeLocators;
+/* Turns single times in nanoseconds (at least one; sorted by this) into the figures of the subjects
+ * "<work>, p50" and "<work>, p99". The subject's own figure is then the mean as always. */
+void percentiles(benchmark::State &state, std::vector<double> &nanoseconds);
 
- private:
-  void *symbol(const char *name) const;
+/* ---- What is asked of it --------------------------------------------------------------------- */
+
+/* Ours, less the baseline, takes at most `most` times what the fastest of the peers takes, less the
+ * baseline. A baseline is the same surrounding work with nothing in it. */
+struct Bar {
+  std::string text; /* what is asked, for a reader */
+  Subject ours;
+  double most;
+  std::vector<Subject> peers;
+  std::vector<Subject> baseline = {}; /* none or one */
 };
+void ask(const Bar &bar);
 
-/* A reachable node, with one interface of four addresses, and its instances, at least one. */
-class WatchedNode {
- public:
-  /* Throws std::runtime_error when an instance cannot be made. */
-  WatchedNode(Cluster &cluster, uint8_t number, size_t instances);
-  ~WatchedNode();
-  WatchedNode(const WatchedNode &) = delete;
-  WatchedNode &operator=(const WatchedNode &) = delete;
+/* The usual one: our figure of this work against the fastest of these peers. */
+void ask(const std::string &work, double most, const std::vector<std::string> &peers);
 
-  KARSTResolverInstance *instance() const { return instances_.front(); }
-  size_t instances() const { return instances_.size(); }
+/* Something that is counted, not timed: the count must be at most `most`. Said while or after the
+ * benchmarks run; said several times, the largest count stands. */
+void askCount(const std::string &text, uint64_t count, uint64_t most);
 
-  /* The interface's entry with other addresses than before. */
-  host::Entry nextChange() { return changes_[changed_++ % 2]; }
+/* A figure to be shown that nothing is asked of, such as bytes a node. */
+void state(const std::string &text, double value, const std::string &unit);
 
-  /* Calls of all instances' callbacks so far, and when the first instance was last called. */
-  uint64_t calls() const { return calls_; }
-  Clock::time_point lastCall() const { return lastCall_; }
+/* ---- Where it runs --------------------------------------------------------------------------- */
 
- private:
-  static void told(void *data, KARSTResolverInstance *instance, uint32_t state);
-  static void toldAndTimed(void *data, KARSTResolverInstance *instance, uint32_t state);
-
-  Cluster &cluster_;
-  const host::Entry changes_[2];
-  size_t changed_ = 0;
-  std::vector<KARSTResolverInstance *> instances_;
-  std::atomic<uint64_t> calls_{0};
-  std::atomic<Clock::time_point> lastCall_{};
-};
-
-void measureMap(const Cluster &cluster);
-void measureTrace(Cluster &cluster);
-void measureReadOut(Cluster &cluster);
-void measureChange(Cluster &cluster);
+/* Binds the calling thread to one processor (counted modulo those at hand), or to all of them. What
+ * it starts afterwards inherits that. The main thread runs on 0. */
+void pin(unsigned processor);
+void unpin();
 
 }  // namespace bench

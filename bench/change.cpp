@@ -7,7 +7,7 @@
 #include <mutex>
 #include <thread>
 
-#include "bench/bench.h"
+#include "bench/subjects.h"
 
 namespace bench {
 namespace {
@@ -155,19 +155,19 @@ void bareRefresh(benchmark::State &state, size_t observers) {
 
 void measureChange(Cluster &cluster) {
   const auto node = std::make_shared<WatchedNode>(cluster, LATENCY_NODE, 1);
-  measure("change to callback", OURS, [&cluster, node](auto &state) {
+  measure({"change to callback"}, [&cluster, node](auto &state) {
     latency(state, cluster, *node);
   })->UseManualTime();
-  measure("change to callback", "two bare hand-offs", bareLatency)->UseManualTime();
+  measure({"change to callback", "two bare hand-offs"}, bareLatency)->UseManualTime();
 
   uint8_t number = LATENCY_NODE;
   for (const size_t instances : {128, 10'000}) {
     const auto many = std::make_shared<WatchedNode>(cluster, ++number, instances);
     const std::string work = "refresh an instance of " + std::to_string(instances);
-    measure(work, OURS, [&cluster, many](auto &state) {
+    measure({work}, [&cluster, many](auto &state) {
       refresh(state, cluster, *many);
     })->UseManualTime();
-    measure(work, "functions called under a mutex", [=](auto &state) {
+    measure({work, "functions called under a mutex"}, [=](auto &state) {
       bareRefresh(state, instances);
     })->UseManualTime();
   }

@@ -1,7 +1,7 @@
 /* The host kernel, its nodes and their instances; see bench.h. */
 #include <stdexcept>
 
-#include "bench/bench.h"
+#include "bench/cluster.h"
 #include "host/directory/records.h"
 
 namespace bench {

@@ -5,7 +5,7 @@
 #include <memory>
 #include <random>
 
-#include "bench/bench.h"
+#include "bench/subjects.h"
 #include "karst/karst_rbtree.h"
 
 namespace bench {
@@ -153,11 +153,11 @@ void measureMap(const Cluster &cluster) {
     const auto ours = std::make_shared<OurMap>(*keys, functions);
     const auto standard = std::make_shared<StdMap>(*keys);
     const std::string size = ", n = " + std::to_string(count);
-    measure("map: find" + size, OURS, [=](auto &state) { find(state, *ours, *keys); });
-    measure("map: find" + size, "std::map", [=](auto &state) { find(state, *standard, *keys); });
+    measure({"map: find" + size}, [=](auto &state) { find(state, *ours, *keys); });
+    measure({"map: find" + size, "std::map"}, [=](auto &state) { find(state, *standard, *keys); });
     const std::string churned = "map: remove and insert" + size;
-    measure(churned, OURS, [=](auto &state) { churn(state, *ours, *keys); });
-    measure(churned, "std::map, node handles",
+    measure({churned}, [=](auto &state) { churn(state, *ours, *keys); });
+    measure({churned, "std::map, node handles"},
             [=](auto &state) { churn(state, *standard, *keys); });
   }
 }

@@ -4,7 +4,7 @@
 #include <mutex>
 #include <shared_mutex>
 
-#include "bench/bench.h"
+#include "bench/subjects.h"
 
 namespace bench {
 namespace {
@@ -42,11 +42,11 @@ void measureReadOut(Cluster &cluster) {
   const auto node = std::make_shared<WatchedNode>(cluster, 2, 1);
 
   const std::string read = "GetNodeLocators, alone";
-  measure(read, OURS, [&cluster, node](auto &state) { readOurs(state, cluster, *node); });
-  measure(read, "copy, std::shared_mutex",
+  measure({read}, [&cluster, node](auto &state) { readOurs(state, cluster, *node); });
+  measure({read, "copy, std::shared_mutex"},
           readBehind<std::shared_mutex, std::shared_lock<std::shared_mutex>>);
-  measure(read, "copy, std::mutex", readBehind<std::mutex, std::lock_guard<std::mutex>>);
-  measure(read, "copy alone", readBehind<NoLock, std::lock_guard<NoLock>>);
+  measure({read, "copy, std::mutex"}, readBehind<std::mutex, std::lock_guard<std::mutex>>);
+  measure({read, "copy alone"}, readBehind<NoLock, std::lock_guard<NoLock>>);
 }
 
 }  // namespace bench

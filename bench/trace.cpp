@@ -4,7 +4,7 @@
 #include <atomic>
 #include <memory>
 
-#include "bench/bench.h"
+#include "bench/subjects.h"
 #include "karst_resolver/trace.h"
 
 namespace bench {
@@ -63,21 +63,21 @@ void measureTrace(Cluster &cluster) {
                      cluster.inModule<TokenBucketMini>("KARSTResolverTraceSetCallbackTb")};
 
   const std::string off = "trace: statement, class off";
-  measure(off, OURS, [=](auto &state) { trace(state, site); });
-  measure(off, "empty call", [](auto &state) {
+  measure({off}, [=](auto &state) { trace(state, site); });
+  measure({off, "empty call"}, [](auto &state) {
     for (auto _ : state) emptyCall();
   });
 
   const std::string written = "trace: statement, written";
   const auto ring = std::make_shared<Ring>();
-  measure(written, OURS, [=](auto &state) {
+  measure({written}, [=](auto &state) {
     const ClassOn on;
     trace(state, site);
   });
-  measure(written, "fetch_add, 64-byte store", [=](auto &state) {
+  measure({written, "fetch_add, 64-byte store"}, [=](auto &state) {
     for (auto _ : state) ring->write(1, 2);
   });
-  measure(written, "clock, fetch_add, 64-byte store", [=](auto &state) {
+  measure({written, "clock, fetch_add, 64-byte store"}, [=](auto &state) {
     for (auto _ : state) {
       ring->write(static_cast<uint64_t>(Clock::now().time_since_epoch().count()), 2);
     }
@@ -87,11 +87,11 @@ void measureTrace(Cluster &cluster) {
   const auto setCallback = [&cluster, node](auto &state) {
     for (auto _ : state) cluster.setCallback(node->instance(), nullptr, nullptr);
   };
-  measure("SetCallback(null), trace written", OURS, [=](auto &state) {
+  measure({"SetCallback(null), trace written"}, [=](auto &state) {
     const ClassOn on;
     setCallback(state);
   });
-  measure("SetCallback(null), trace written", "the same, class off", setCallback);
+  measure({"SetCallback(null), trace written", "the same, class off"}, setCallback);
 }
 
 }  // namespace bench

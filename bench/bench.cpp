@@ -1,0 +1,103 @@
+/* Names, bars and processors; see bench.h. */
+#include "bench/bench.h"
+
+#include <pthread.h>
+#include <sched.h>
+
+#include <algorithm>
+#include <stdexcept>
+#include <thread>
+
+#include "bench/registry.h"
+
+namespace bench {
+namespace {
+
+const std::string SEPARATOR = " | ";
+
+/* The processors that this program may use, as they were at its start. */
+cpu_set_t processorsAtHand() {
+  cpu_set_t processors;
+  if (sched_getaffinity(0, sizeof processors, &processors) != 0) {
+    throw std::runtime_error("which processors are at hand cannot be told");
+  }
+  return processors;
+}
+const cpu_set_t atHand = processorsAtHand();
+
+void runOn(const cpu_set_t &processors) {
+  if (pthread_setaffinity_np(pthread_self(), sizeof processors, &processors) != 0) {
+    throw std::runtime_error("a thread cannot be bound to its processor");
+  }
+}
+
+template <typename Said>
+Said *already(std::vector<Said> &said, const std::string &text) {
+  const auto found =
+      std::find_if(said.begin(), said.end(), [&](const Said &one) { return one.text == text; });
+  return found == said.end() ? nullptr : &*found;
+}
+
+}  // namespace
+
+Registry &registry() {
+  static Registry registry;
+  return registry;
+}
+
+std::string nameOf(const Subject &subject) {
+  registry().subjects.push_back(subject);
+  return subject.work + SEPARATOR + subject.who;
+}
+
+Subject subjectOf(const std::string &name) {
+  const size_t end = name.find(SEPARATOR);
+  return {name.substr(0, end), name.substr(end + SEPARATOR.size())};
+}
+
+void percentiles(benchmark::State &state, std::vector<double> &nanoseconds) {
+  std::sort(nanoseconds.begin(), nanoseconds.end());
+  state.counters[P50] = nanoseconds[nanoseconds.size() / 2];
+  state.counters[P99] = nanoseconds[nanoseconds.size() * 99 / 100];
+}
+
+void ask(const Bar &bar) {
+  registry().bars.push_back(bar);
+}
+
+void ask(const std::string &work, double most, const std::vector<std::string> &peers) {
+  Bar bar{work, {work}, most, {}};
+  for (const std::string &peer : peers) bar.peers.push_back({work, peer});
+  ask(bar);
+}
+
+void askCount(const std::string &text, uint64_t count, uint64_t most) {
+  if (Count *said = already(registry().counts, text)) {
+    said->count = std::max(said->count, count);
+  } else {
+    registry().counts.push_back({text, count, most});
+  }
+}
+
+void state(const std::string &text, double value, const std::string &unit) {
+  if (already(registry().statements, text) == nullptr) {
+    registry().statements.push_back({text, value, unit});
+  }
+}
+
+void pin(unsigned processor) {
+  unsigned skip = processor % static_cast<unsigned>(CPU_COUNT(&atHand));
+  for (int number = 0; number < CPU_SETSIZE; number++) {
+    if (!CPU_ISSET(number, &atHand) || skip-- != 0) continue;
+    cpu_set_t one;
+    CPU_ZERO(&one);
+    CPU_SET(number, &one);
+    return runOn(one);
+  }
+}
+
+void unpin() {
+  runOn(atHand);
+}
+
+}  // namespace bench

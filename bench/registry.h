@@ -1,0 +1,36 @@
+/* What has been said with the functions of bench.h, for the figures to be judged by. */
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include "bench/bench.h"
+
+namespace bench {
+
+struct Count {
+  std::string text;
+  uint64_t count, most;
+};
+
+struct Statement {
+  std::string text;
+  double value;
+  std::string unit;
+};
+
+struct Registry {
+  std::vector<Subject> subjects; /* in the order in which they were first named */
+  std::vector<Bar> bars;
+  std::vector<Count> counts;
+  std::vector<Statement> statements;
+};
+
+Registry &registry();
+
+/* The subject that the benchmark library knows by this name. */
+Subject subjectOf(const std::string &name);
+
+inline constexpr const char *P50 = "p50", *P99 = "p99"; /* counters, in nanoseconds */
+
+}  // namespace bench

@@ -1,0 +1,13 @@
+/* What karst-bench measures, a file each: registers its subjects and what is asked of them. */
+#pragma once
+
+#include "bench/cluster.h"
+
+namespace bench {
+
+void measureMap(const Cluster &cluster);
+void measureTrace(Cluster &cluster);
+void measureReadOut(Cluster &cluster);
+void measureChange(Cluster &cluster);
+
+}  // namespace bench

@@ -9,6 +9,7 @@
 #include <functional>
 #include <memory>
 #include <string>
+#include <vector>
 
 namespace sim {
 
@@ -37,9 +38,12 @@ struct WaitQueue {
   Fiber *last = nullptr;
 };
 
-/* A stack with a guard page below it. */
+/* A stack with a guard page below it. One whose fiber has ended serves the next one, also on the
+ * next machine. */
 class Stack {
  public:
+  static std::unique_ptr<Stack> take();
+  static void giveBack(std::unique_ptr<Stack> stack);
   Stack();
   ~Stack();
   Stack(const Stack &) = delete;
@@ -47,9 +51,9 @@ class Stack {
   void *top() const { return top_; }
   void *bottom() const { return bottom_; } /* the guard page lies below */
   size_t size() const { return static_cast<size_t>(top_ - bottom_); }
-  void clean(); /* before its next fiber */
 
  private:
+  inline static std::vector<std::unique_ptr<Stack>> spare_;
   char *bottom_;
   char *top_;
 };
@@ -58,6 +62,7 @@ class Fiber {
  public:
   uint32_t id() const { return id_; } /* 1, 2, ... in the order of their making */
   const std::string &name() const { return *name_; }
+  uint64_t nameHash() const { return nameHash_; }
 
   World *world = nullptr; /* the world that this fiber is the body of */
 
@@ -85,8 +90,9 @@ class Fiber {
 
   uint32_t id_ = 0;
   const std::string *name_ = nullptr; /* interned */
-  bool ready_ = true;                 /* blocked on nothing */
-  bool heldBack_ = false;             /* the driver does not let it run */
+  uint64_t nameHash_ = 0;
+  bool ready_ = true;     /* blocked on nothing */
+  bool heldBack_ = false; /* the driver does not let it run */
   bool ended_ = false;
   bool timedOut_ = false;
   Wait wait_{};

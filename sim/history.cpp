@@ -4,7 +4,6 @@
 #include <algorithm>
 #include <bit>
 #include <cstring>
-#include <functional>
 #include <map>
 
 #include "host/kernel/text.h"
@@ -46,8 +45,10 @@ Argument Argument::name(const zel_Name &name) {
 }
 
 uint64_t Argument::hash() const {
+  constexpr size_t wordsUsed[] = {0, 1, 2, 4}; /* by kind */
   uint64_t hash = static_cast<uint64_t>(kind_) << 8 | type_;
-  for (const uint64_t word : words_) hash = (hash ^ word) * 0x9e3779b97f4a7c15u + (hash >> 31);
+  for (size_t i = 0; i < wordsUsed[static_cast<size_t>(kind_)]; ++i)
+    hash = (hash ^ words_[i]) * 0x9e3779b97f4a7c15u + (hash >> 31);
   return hash;
 }
 
@@ -98,11 +99,10 @@ std::vector<HistoryEntry> History::entries() const {
   return entries;
 }
 
-void History::noteSuccession(const HistoryEntry &entry) {
-  const uint64_t call =
-      std::hash<std::string>()(*entry.fiberName) * callCount + static_cast<uint64_t>(entry.call);
-  if (entry.fiber != lastFiber_) successions_->add(lastCall_ * 0x9e3779b97f4a7c15u ^ call);
-  lastFiber_ = entry.fiber;
+void History::noteSuccession(const Fiber &fiber, Call made) {
+  const uint64_t call = fiber.nameHash() * callCount + static_cast<uint64_t>(made);
+  if (fiber.id() != lastFiber_) successions_->add(lastCall_ * 0x9e3779b97f4a7c15u ^ call);
+  lastFiber_ = fiber.id();
   lastCall_ = call;
 }
 

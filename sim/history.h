@@ -53,23 +53,22 @@ class History {
  public:
   explicit History(size_t length); /* in calls; 0: keeps nothing */
 
+  /* With nothing kept, nobody need make entries. */
+  bool keeps() const { return !ring_.empty(); }
+
   /* A call begins; the number names it to end(). */
   uint64_t begin(const HistoryEntry &entry) {
-    if (successions_) noteSuccession(entry);
-    if (!ring_.empty()) ring_[made_ & mask_] = entry;
-    return made_++;
+    note(entry);
+    return made_ - 1;
   }
   void end(uint64_t number, uint64_t result, bool injected) {
-    if (ring_.empty() || made_ - number > ring_.size()) return;
+    if (made_ - number > ring_.size()) return;
     HistoryEntry &entry = ring_[number & mask_];
     entry.result = result;
     entry.injected = injected;
     entry.returned = true;
   }
-  void note(const HistoryEntry &entry) {
-    if (!ring_.empty()) ring_[made_ & mask_] = entry;
-    ++made_;
-  }
+  void note(const HistoryEntry &entry) { ring_[made_++ & mask_] = entry; }
   void clear();
 
   /* The last calls, oldest first. */
@@ -80,15 +79,18 @@ class History {
   std::string timeline(size_t lines) const;
 
   /* Every history of the process tells `sketch` of calls that follow directly on a call of another
-   * fiber: which call of whom on which call of whom. Null: none. */
+   * fiber: which call of whom on which call of whom. Null: none. Whatever else is kept. */
   static void setSuccessions(Sketch *sketch) { successions_ = sketch; }
+  void follows(const Fiber &fiber, Call call) {
+    if (successions_) noteSuccession(fiber, call);
+  }
 
   /* How many lines the report of a panic shows. */
   static void setReportLines(size_t lines) { reportLines_ = lines; }
   static size_t reportLines() { return reportLines_; }
 
  private:
-  void noteSuccession(const HistoryEntry &entry);
+  void noteSuccession(const Fiber &fiber, Call call);
 
   inline static Sketch *successions_ = nullptr;
   inline static size_t reportLines_ = 60;

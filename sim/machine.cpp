@@ -16,8 +16,6 @@ namespace sim {
 
 namespace {
 
-Machine *onlyMachine = nullptr;
-
 std::unique_ptr<Strategy> strategyOf(Switching switching, uint64_t seed) {
   if (switching == Switching::Random) return std::make_unique<RandomWalk>(seed);
   return std::make_unique<RunOn>();
@@ -29,12 +27,13 @@ Machine::Machine(const Settings &settings)
     : settings_(settings),
       scheduler_(strategyOf(settings.switching, settings.seed)),
       history_(settings.historyLength) {
-  onlyMachine = this;
+  existing_ = this;
   scheduler_.setStepLimit(settings.stepLimit);
   host::setPanicReport([this] {
-    return host::formatText("seed %llu, step %llu; the last calls:\n",
+    return host::formatText("seed %llu, step %llu%s",
                             static_cast<unsigned long long>(settings_.seed),
-                            static_cast<unsigned long long>(scheduler_.steps())) +
+                            static_cast<unsigned long long>(scheduler_.steps()),
+                            history_.keeps() ? "; the last calls:\n" : "") +
            timeline(History::reportLines());
   });
 }
@@ -42,16 +41,11 @@ Machine::Machine(const Settings &settings)
 Machine::~Machine() {
   settleAndRequireNothingLeft();
   host::setPanicReport({});
-  onlyMachine = nullptr;
+  existing_ = nullptr;
 }
 
-Machine &Machine::current() {
-  if (!onlyMachine) host::panic("no simulated machine is there");
-  return *onlyMachine;
-}
-
-Machine *Machine::existing() {
-  return onlyMachine;
+void Machine::requireExisting() {
+  if (!existing_) host::panic("no simulated machine is there");
 }
 
 access::Recorder &Machine::watch() {
@@ -132,6 +126,7 @@ void Machine::settleAndRequireNothingLeft() {
 }
 
 void Machine::note(const char *what, const Argument &argument, std::optional<zel_Status> status) {
+  if (!history_.keeps()) return;
   const Fiber &fiber = scheduler_.running();
   history_.note({.step = scheduler_.steps(),
                  .time = scheduler_.now(),
@@ -189,6 +184,8 @@ PlatformCall::PlatformCall(Call call, const Argument &argument, const void *call
   Scheduler &scheduler = machine_.scheduler_;
   scheduler.mix(static_cast<uint64_t>(call) << 32 | fiber_.id());
   scheduler.mix(argument.hash());
+  machine_.history_.follows(fiber_, call);
+  if (!machine_.history_.keeps()) return;
   number_ = machine_.history_.begin({.step = scheduler.steps(),
                                      .time = scheduler.now(),
                                      .fiber = fiber_.id(),
@@ -202,7 +199,7 @@ PlatformCall::~PlatformCall() {
   if (!recorded_) return;
   if (fault_ != ZEL_OK) result_ = fault_;
   machine_.scheduler_.mix(result_);
-  machine_.history_.end(number_, result_, fault_ != ZEL_OK);
+  if (machine_.history_.keeps()) machine_.history_.end(number_, result_, fault_ != ZEL_OK);
 }
 
 }  // namespace sim

@@ -72,8 +72,11 @@ class Machine {
   Machine(const Machine &) = delete;
   Machine &operator=(const Machine &) = delete;
 
-  static Machine &current();  /* panics when there is none */
-  static Machine *existing(); /* null when there is none */
+  static Machine *existing() { return existing_; } /* null when there is none */
+  static Machine &current() {
+    if (!existing_) requireExisting();
+    return *existing_;
+  }
 
   const Settings &settings() const { return settings_; }
 
@@ -143,6 +146,7 @@ class Machine {
 
   /* ---- What happened. ------------------------------------------------------------------------ */
 
+  bool keepsHistory() const { return history_.keeps(); }
   std::vector<HistoryEntry> history() const { return history_.entries(); }
   void clearHistory() { history_.clear(); }
 
@@ -185,6 +189,7 @@ class Machine {
 
  private:
   friend class PlatformCall;
+  static void requireExisting(); /* or stops the system */
 
   struct Faults {
     struct Range {
@@ -196,6 +201,7 @@ class Machine {
     std::vector<Range> ranges;
   };
 
+  inline static Machine *existing_ = nullptr;
   Settings settings_;
   Scheduler scheduler_;
   History history_;

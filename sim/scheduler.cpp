@@ -50,8 +50,16 @@ Stack::~Stack() {
   boost::context::protected_fixedsize_stack(sanitizers::stackSize).deallocate(memory);
 }
 
-void Stack::clean() {
-  sanitizers::stackCleaned(bottom_, size());
+std::unique_ptr<Stack> Stack::take() {
+  if (spare_.empty()) return std::make_unique<Stack>();
+  std::unique_ptr<Stack> stack = std::move(spare_.back());
+  spare_.pop_back();
+  return stack;
+}
+
+void Stack::giveBack(std::unique_ptr<Stack> stack) {
+  sanitizers::stackCleaned(stack->bottom_, stack->size());
+  spare_.push_back(std::move(stack));
 }
 
 /* ---- Reports --------------------------------------------------------------------------------- */
@@ -132,14 +140,10 @@ Fiber &Scheduler::spawn(const std::string &name, std::function<void()> body,
   auto fiber = std::make_unique<Fiber>();
   fiber->id_ = ++lastId_;
   fiber->name_ = intern(name);
+  fiber->nameHash_ = std::hash<std::string>()(name);
   fiber->body_ = std::move(body);
   fiber->onEnd_ = std::move(onEnd);
-  if (freeStacks_.empty()) {
-    fiber->stack_ = std::make_unique<Stack>();
-  } else {
-    fiber->stack_ = std::move(freeStacks_.back());
-    freeStacks_.pop_back();
-  }
+  fiber->stack_ = Stack::take();
   fiber->stackTop_ = static_cast<char *>(fiber->stack_->top());
   fiber->stackBottom_ = static_cast<char *>(fiber->stack_->bottom());
   fiber->context_ =
@@ -175,8 +179,7 @@ void Scheduler::runBody() {
 void Scheduler::reap(Fiber &fiber) {
   sanitizers::endThread(fiber.threadSanitizerFiber_);
   access::ends(fiber);
-  fiber.stack_->clean();
-  freeStacks_.push_back(std::move(fiber.stack_));
+  Stack::giveBack(std::move(fiber.stack_));
   const auto place = std::find_if(fibers_.begin(), fibers_.end(),
                                   [&](const auto &other) { return other.get() == &fiber; });
   fibers_.erase(place);

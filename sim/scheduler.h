@@ -118,7 +118,6 @@ class Scheduler {
   uint32_t lastId_ = 0;
   std::vector<Fiber *> runnable_; /* ready and not held back, longest first */
   std::vector<std::unique_ptr<Fiber>> fibers_;
-  std::vector<std::unique_ptr<Stack>> freeStacks_;
   std::vector<std::string> heldPrefixes_;
   std::exception_ptr escaped_;
 };

@@ -15,43 +15,54 @@ using host::formatText;
 
 /* ---- Structure ------------------------------------------------------------------------------- */
 
+uint64_t wordOf(const char *tag) {
+  uint64_t word;
+  std::memcpy(&word, tag, sizeof word);
+  return word;
+}
+
 bool isTag(const char *tag, const char *text) {
-  return std::memcmp(tag, text, 8) == 0;
+  return wordOf(tag) == wordOf(text);
 }
 
 bool isFreeTag(const char *tag, const char *text) {
-  return std::equal(tag, tag + 8, text, [](char a, char b) { return a == static_cast<char>(~b); });
+  return wordOf(tag) == ~wordOf(text);
 }
 
-/* The structures on a list, whose links must lead the same way forth and back. */
+/* The structures on a list, whose links must lead the same way forth and back. `owner`: of the
+ * list, if it is one of several. */
 template <typename Element>
 std::vector<const Element *> elementsOf(const KARSTResolverLink &head, size_t offset,
-                                        const std::string &what, Lines &lines) {
+                                        const char *what, Lines &lines,
+                                        const zel_UUID *owner = nullptr) {
+  const auto damaged = [&](const std::string &how) {
+    lines.push_back(what + (owner != nullptr ? " of node " + host::toString(*owner) : "") + how);
+  };
   std::vector<const Element *> elements;
   const KARSTResolverLink *previous = &head;
   for (const KARSTResolverLink *link = head.next; link != &head; link = link->next) {
     if (link == nullptr || link->previous != previous || elements.size() == 100'000) {
-      lines.push_back(formatText("%s: broken at %zu", what.c_str(), elements.size()));
+      damaged(": broken at " + std::to_string(elements.size()));
       return elements;
     }
     elements.push_back(
         reinterpret_cast<const Element *>(reinterpret_cast<const uint8_t *>(link) - offset));
     previous = link;
   }
-  if (head.previous != previous) lines.push_back(what + ": its last element is another one");
+  if (head.previous != previous) damaged(": its last element is another one");
   return elements;
 }
 
 std::vector<const KARSTResolverNetIf *> netIfsOf(const KARSTResolverNode *node, Lines &lines) {
   return elementsOf<KARSTResolverNetIf>(node->netIfList, offsetof(KARSTResolverNetIf, nodeLinks),
-                                        "interfaces of node " + host::toString(node->uuid), lines);
+                                        "interfaces", lines, &node->uuid);
 }
 
 std::vector<const KARSTResolverInstance *> instancesOf(const KARSTResolverNode *node,
                                                        Lines &lines) {
-  return elementsOf<KARSTResolverInstance>(
-      node->instanceList, offsetof(KARSTResolverInstance, nodeLinks),
-      "instances of node " + host::toString(node->uuid), lines);
+  return elementsOf<KARSTResolverInstance>(node->instanceList,
+                                           offsetof(KARSTResolverInstance, nodeLinks), "instances",
+                                           lines, &node->uuid);
 }
 
 /* The node tree: colours, heights, parents, order, number. */
@@ -104,32 +115,45 @@ class TreeWalk {
   Lines &lines_;
 };
 
+/* All bytes but the tag and the place on the free list. */
+template <typename Slot>
+bool isEmpty(const Slot &slot) {
+  static constexpr Slot empty{};
+  constexpr size_t links = offsetof(Slot, freeLinks);
+  static_assert(offsetof(Slot, tag) == 0 && links >= sizeof empty.tag);
+  const auto same = [&](size_t from, size_t to) {
+    return std::memcmp(reinterpret_cast<const uint8_t *>(&slot) + from,
+                       reinterpret_cast<const uint8_t *>(&empty) + from, to - from) == 0;
+  };
+  return same(sizeof empty.tag, links) && same(links + sizeof empty.freeLinks, sizeof empty);
+}
+
 /* Every slot is in use and known, or free, listed and empty. */
 template <typename Slot>
 void checkSlots(const Slot *pool, uint32_t size, const char *tag, std::set<const Slot *> used,
                 const KARSTResolverLink &freeList, Lines &lines) {
   const std::string what = std::string(tag, 8) + " slots";
+  const std::string free = "free " + what;
   size_t freeSlots = 0;
   for (const Slot *slot :
-       elementsOf<Slot>(freeList, offsetof(Slot, freeLinks), "free " + what, lines)) {
-    Slot empty{};
-    std::memcpy(empty.tag, slot->tag, sizeof empty.tag);
-    empty.freeLinks = slot->freeLinks;
+       elementsOf<Slot>(freeList, offsetof(Slot, freeLinks), free.c_str(), lines)) {
     const bool inPool = slot >= pool && slot < pool + size;
-    if (!inPool || !isFreeTag(slot->tag, tag) || std::memcmp(&empty, slot, sizeof empty) != 0) {
-      lines.push_back(formatText("free %s: %zu is not empty", what.c_str(), freeSlots));
+    if (!inPool || !isFreeTag(slot->tag, tag) || !isEmpty(*slot)) {
+      lines.push_back(formatText("%s: %zu is not empty", free.c_str(), freeSlots));
     }
     ++freeSlots;
   }
+  size_t tagged = 0;
   for (uint32_t i = 0; i < size; i++) {
     const bool inUse = isTag(pool[i].tag, tag);
-    if (inUse != (used.count(&pool[i]) != 0) || (!inUse && !isFreeTag(pool[i].tag, tag))) {
+    tagged += inUse;
+    if (inUse ? used.count(&pool[i]) == 0 : !isFreeTag(pool[i].tag, tag)) {
       lines.push_back(formatText("%s: the tag of %u is wrong", what.c_str(), i));
     }
   }
-  if (freeSlots + used.size() != size) {
-    lines.push_back(
-        formatText("%s: %zu free and %zu in use", what.c_str(), freeSlots, used.size()));
+  if (tagged != used.size() || freeSlots + used.size() != size) {
+    lines.push_back(formatText("%s: %zu free, %zu in use, %zu by their tags", what.c_str(),
+                               freeSlots, used.size(), tagged));
   }
 }
 

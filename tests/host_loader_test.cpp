@@ -172,6 +172,28 @@ TEST_F(Loader, KeepsAProviderWhileAnythingUsesIt) {
   EXPECT_THAT(errorOf([&] { loader.unload(provider); }), HasSubstr("in use by user.so;"));
 }
 
+/* In children, since what is kept is kept for good. */
+TEST_F(Loader, AKeptModuleBeginsAfreshAndIsOutOfReachMeanwhile) {
+  const auto loadOnce = [&] {
+    host::keepUnloadedModules();
+    events.clear();
+    host::Module &module = load("provider");
+    auto *const next = module.function<int32_t()>("Counter_Next");
+    next();
+    loader.unload(module);
+    return next;
+  };
+  const auto loadTwice = [&] {
+    loadOnce();
+    const auto first = events;
+    loadOnce();
+    const bool equal = events[0] == first[0] && events[2] == first[2];
+    _exit(equal && events[2] == std::pair<std::string, int64_t>("provider cleanup", 41) ? 0 : 1);
+  };
+  EXPECT_EXIT(loadTwice(), testing::ExitedWithCode(0), "");
+  EXPECT_DEATH(loadOnce()(), "");
+}
+
 TEST_F(Loader, AModuleThatCannotLeaveIsFatal) {
   EXPECT_DEATH(loader.unload(load("stays")), "stays.so stays in the process after its unload");
 }

@@ -201,6 +201,11 @@ Elf_Scn *ElfImage::sectionOfType(uint32_t sectionType) const {
   return nullptr;
 }
 
+bool ElfImage::hasConstructors() const {
+  return sectionOfType(SHT_INIT_ARRAY) != nullptr || sectionOfType(SHT_FINI_ARRAY) != nullptr ||
+         section(".init") || section(".fini");
+}
+
 std::vector<ElfImage::Symbol> ElfImage::symbolsOf(uint32_t sectionType) const {
   std::vector<Symbol> symbols;
   Elf_Scn *const section = sectionOfType(sectionType);

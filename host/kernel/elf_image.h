@@ -44,6 +44,9 @@ class ElfImage {
   /* Can `size` bytes at an address be written once the file is mapped? */
   bool isWritable(uint64_t address, uint64_t size) const;
 
+  /* Is there code that runs when the file is mapped or unmapped? */
+  bool hasConstructors() const;
+
   /* Bytes of memory that the mapped file spans, from address 0. */
   uint64_t memorySize() const;
 

@@ -1,6 +1,6 @@
 /* Loads modules with the system's dynamic linker. loadLock serialises loads and unloads and is held
- * across a module's own init and cleanup; listLock guards the list of loaded modules, is taken
- * inside it and held briefly.
+ * across a module's own init and cleanup; listLock guards the list of loaded modules, keptLock the
+ * list of kept ones, which all loaders share. Both are taken inside it and held briefly.
  */
 #include "host/kernel/module_loader.h"
 
@@ -16,6 +16,7 @@
 #include <set>
 #include <string_view>
 
+#include "host/kernel/module_memory.h"
 #include "host/kernel/panic.h"
 #include "host/kernel/symbols.h"
 #include "host/kernel/text.h"
@@ -125,19 +126,62 @@ bool isResident(const std::string &path) {
 
 }  // namespace
 
-struct Module::Impl {
+struct Module::Impl : std::enable_shared_from_this<Module::Impl> {
   explicit Impl(const std::filesystem::path &path) : file(path) {}
+  static std::shared_ptr<Impl> of(const std::filesystem::path &path); /* kept from before, or new */
   void map();
   void unmap();
+  void keep(const ElfImage &image);
   void setParameters(const std::vector<ParameterValue> &values) const;
 
   ModuleFile file;
   void *handle = nullptr;
   MappedModule mapped;
   std::set<const Module *> uses; /* whose namespaces it requires, or whose exports it calls */
+  bool loaded = false;
+  std::optional<ModuleMemory> memory; /* of one that is kept */
+
+  static std::mutex keptLock;
+  static bool keeping;
+  static std::vector<std::shared_ptr<Impl>> kept; /* mapped for good, loaded or not */
 };
 
+std::mutex Module::Impl::keptLock;
+bool Module::Impl::keeping = false;
+std::vector<std::shared_ptr<Module::Impl>> Module::Impl::kept;
+
+std::shared_ptr<Module::Impl> Module::Impl::of(const std::filesystem::path &path) {
+  const std::lock_guard guard(keptLock);
+  for (const auto &known : kept) {
+    if (known->loaded || known->file.path != path) continue;
+    known->uses.clear();
+    return known;
+  }
+  return std::make_shared<Impl>(path);
+}
+
+/* One with constructors begins afresh only when it is mapped, and one that uses another goes with
+ * it. */
+void Module::Impl::keep(const ElfImage &image) {
+  const std::lock_guard guard(keptLock);
+  if (!keeping || image.hasConstructors() || !uses.empty()) return;
+  memory.emplace(mapped.base, mapped.size);
+  kept.push_back(shared_from_this());
+}
+
+void keepUnloadedModules() {
+  const std::lock_guard guard(Module::Impl::keptLock);
+  Module::Impl::keeping = true;
+}
+
+void revealKeptModules() {
+  for (const auto &module : Module::Impl::kept)
+    if (!module->loaded) module->memory->reveal();
+}
+
 void Module::Impl::map() {
+  loaded = true;
+  if (memory) return memory->renew();
   const std::string path = file.path.string();
   const ElfImage image(file.path);
   handle = dlopen(path.c_str(), RTLD_NOW | RTLD_GLOBAL);
@@ -151,9 +195,13 @@ void Module::Impl::map() {
   mapped.size = image.memorySize();
   mapped.symbols = image.definedSymbols();
   addMappedModule(&mapped);
+  keep(image);
 }
 
 void Module::Impl::unmap() {
+  loaded = false;
+  if (memory)
+    return memory->withdraw(); /* it still lies there: for reports, and nobody binds to it */
   removeMappedModule(&mapped);
   dlclose(handle);
   handle = nullptr;
@@ -174,7 +222,7 @@ void Module::Impl::setParameters(const std::vector<ParameterValue> &values) cons
   }
 }
 
-Module::Module(std::unique_ptr<Impl> impl) : impl_(std::move(impl)) {}
+Module::Module(std::shared_ptr<Impl> impl) : impl_(std::move(impl)) {}
 Module::~Module() = default;
 
 const std::string &Module::name() const {
@@ -330,18 +378,18 @@ Module &ModuleLoader::load(const std::filesystem::path &path,
   const std::lock_guard loading(impl_->loadLock);
   std::error_code error;
   const auto canonical = std::filesystem::canonical(path, error);
-  auto module = std::make_unique<Module::Impl>(error ? path : canonical);
+  const std::shared_ptr<Module::Impl> module = Module::Impl::of(error ? path : canonical);
   module->mapped.name = module->file.path.filename().string();
   module->mapped.id = nextModuleID();
 
-  impl_->checkNotLoaded(module->file);
+  if (!module->memory) impl_->checkNotLoaded(module->file);
   impl_->checkProvided(module->file);
   impl_->checkRequired(*module);
-  impl_->checkSymbols(*module);
+  if (!module->memory) impl_->checkSymbols(*module); /* else they are bound already */
   impl_->start(*module, parseParameters(module->file, parameters));
 
   const std::lock_guard guard(impl_->listLock);
-  impl_->modules.push_back(std::unique_ptr<Module>(new Module(std::move(module))));
+  impl_->modules.push_back(std::unique_ptr<Module>(new Module(module)));
   return *impl_->modules.back();
 }
 

@@ -36,9 +36,11 @@ class Module {
 
  private:
   friend class ModuleLoader;
+  friend void keepUnloadedModules();
+  friend void revealKeptModules();
   struct Impl;
-  explicit Module(std::unique_ptr<Impl> impl);
-  std::unique_ptr<Impl> impl_;
+  explicit Module(std::shared_ptr<Impl> impl);
+  std::shared_ptr<Impl> impl_;
 };
 
 /* Loads and unloads are done one at a time; another thread's waits. init_module and cleanup_module
@@ -67,6 +69,15 @@ class ModuleLoader {
   struct Impl;
   std::unique_ptr<Impl> impl_;
 };
+
+/* For a program that loads one module again and again: from now on a module stays mapped when it is
+ * unloaded, out of reach of everybody, and its next load begins with its variables as the dynamic
+ * linker first filled them in. Its init_module and cleanup_module run each time. Not kept are
+ * modules with constructors, which run only when they are mapped, and modules that use another. */
+void keepUnloadedModules();
+
+/* So that the report of a call into a kept module can name what lies there. */
+void revealKeptModules();
 
 /* "KARSTResolver_Create+0x42 in karst_resolver.so", or the bare address. Knows loaded modules
  * (their whole symbol tables) and the program. */

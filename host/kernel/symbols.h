@@ -25,7 +25,7 @@ struct MappedModule {
   void *find(const std::string &symbol) const;
 };
 
-/* `module` stays in place and unchanged until removed. */
+/* `module` stays in place until removed, and unchanged but for the ID of a kept one. */
 void addMappedModule(const MappedModule *module);
 void removeMappedModule(const MappedModule *module);
 

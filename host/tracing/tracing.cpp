@@ -9,11 +9,11 @@
 #include <atomic>
 #include <bit>
 #include <chrono>
+#include <cstring>
 #include <mutex>
 #include <new>
 #include <stdexcept>
 #include <string>
-#include <utility>
 
 #include "host/kernel/log.h"
 #include "host/tracing/token_bucket.h"
@@ -60,12 +60,20 @@ TraceStream &modulesStream() {
 
 constexpr std::align_val_t kStreamAlignment{64};
 
-/* A ring of zeros is one without a finished record, since the first lap's phase is 1. */
-TraceStream *newStream(const TraceSettings &settings) {
-  const size_t size = TRACE_STREAM_RING + size_t{settings.slots} * sizeof(TraceRecord);
-  auto *memory = static_cast<unsigned char *>(::operator new(size, kStreamAlignment));
-  std::fill_n(memory, size, static_cast<unsigned char>(0));
-  auto *stream = reinterpret_cast<TraceStream *>(memory);
+/* A stream of zeros, which has no finished record, since the first lap's phase is 1. One of the
+ * same size is used again: no more of it needs to be cleared than was written. */
+TraceStream *emptyStream(uint32_t slots, TraceStream *before) {
+  const bool again = before != nullptr && before->mask == slots - 1;
+  const size_t size = TRACE_STREAM_RING + size_t{slots} * sizeof(TraceRecord);
+  const size_t written = again ? std::min<uint64_t>(before->sequence, slots) : slots;
+  void *memory = again ? before : ::operator new(size, kStreamAlignment);
+  std::memset(memory, 0, TRACE_STREAM_RING + written * sizeof(TraceRecord));
+  if (!again) ::operator delete(before, kStreamAlignment);
+  return static_cast<TraceStream *>(memory);
+}
+
+TraceStream *newStream(const TraceSettings &settings, TraceStream *before) {
+  TraceStream *stream = emptyStream(settings.slots, before);
   stream->mask = settings.slots - 1;
   stream->lapShift = static_cast<uint16_t>(std::countr_zero(settings.slots));
   stream->throttling = settings.throttling ? 1 : 0;
@@ -125,7 +133,8 @@ void configureTracing(const TraceSettings &settings) {
                                 " slots: the number must be a power of two");
   }
   Tracing &all = tracing();
-  TraceStream *stream = newStream(settings);
+  auto &stream = traceStreamTables[kModulesStream];
+  stream = newStream(settings, static_cast<TraceStream *>(stream));
   setMiniBucketRate({settings.perEventBurst, settings.perEventPerSecond});
   for (auto &level : all.levels) level = settings.classLevel;
   all.notifications = 0;
@@ -133,8 +142,6 @@ void configureTracing(const TraceSettings &settings) {
     const std::lock_guard guard(all.wallClockMutex);
     all.wallClockCount = 0;
   }
-  void *before = std::exchange(traceStreamTables[kModulesStream], stream);
-  ::operator delete(before, kStreamAlignment);
 }
 
 void setTraceClassLevel(uint32_t traceClass, int32_t level) {
@@ -155,12 +162,13 @@ void setTraceEnabled(bool on) {
       .store(on ? TRACE_STREAM_ENABLED : 0, std::memory_order_relaxed);
 }
 
-std::vector<TracedRecord> readTrace() {
+std::vector<TracedRecord> readTrace(uint64_t from) {
   TraceStream &stream = modulesStream();
   const uint64_t end = load(stream.sequence);
   const uint64_t slots = stream.mask + 1;
   std::vector<TracedRecord> records;
-  for (uint64_t sequence = end > slots ? end - slots : 0; sequence < end; ++sequence) {
+  from = std::max(from, end > slots ? end - slots : 0);
+  for (uint64_t sequence = from; sequence < end; ++sequence) {
     TracedRecord record{};
     if (readRecord(stream, sequence, record)) records.push_back(record);
   }

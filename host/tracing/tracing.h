@@ -35,16 +35,16 @@ void setTraceClassLevel(uint32_t traceClass, int32_t level);
 void setTraceThrottling(bool on);
 void setTraceEnabled(bool on);
 
-/* The finished records of the ring, oldest first: those whose phase and sequence number belong to
- * the last lap. Safe while others emit: what is unfinished, or overwritten meanwhile, is left out.
- */
+/* The finished records of the ring from a sequence number on, oldest first: those whose phase and
+ * sequence number belong to the last lap. Safe while others emit: what is unfinished, or
+ * overwritten meanwhile, is left out. */
 struct TracedRecord {
   uint64_t sequence;
   uint32_t type, id, site, processor;
   uint64_t timeNanoseconds;
   uint64_t payload[6];
 };
-std::vector<TracedRecord> readTrace();
+std::vector<TracedRecord> readTrace(uint64_t from = 0);
 
 /* The last 256 pairs of a record's time stamp and the wall clock (ns since 1970) at that moment. */
 struct WallClockEntry {

@@ -29,7 +29,7 @@ Case makeCase(const Scenario &scenario, uint64_t seed, const StrategyName &strat
 /* What is the same for many cases. */
 struct Playing {
   std::filesystem::path module;
-  size_t historyLength = 4096; /* in calls */
+  size_t historyLength = 0; /* in calls; what fails is played once more with one */
 };
 
 /* Plays the case in this process. Where it leaves the default schedule is noted in `log`, unless

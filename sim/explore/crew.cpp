@@ -19,6 +19,7 @@
 #include <exception>
 #include <system_error>
 
+#include "host/kernel/module_loader.h"
 #include "host/kernel/panic.h"
 #include "sim/sanitizers.h"
 #include "sim/scheduler.h"
@@ -62,6 +63,7 @@ void lookForSteps(int) {
 #if !defined(SIM_ADDRESS_SANITIZER) && !defined(SIM_THREAD_SANITIZER)
 void reportCrash(int signal, siginfo_t *info, void *) {
   endSoon();
+  host::revealKeptModules();
   host::panic("%s at address %p", strsignal(signal), info->si_addr);
 }
 #endif
@@ -70,11 +72,12 @@ void handle(int signal, const struct sigaction &action) {
   if (sigaction(signal, &action, nullptr) != 0) host::panic("signal %d has no handler", signal);
 }
 
-/* What one run gives back the next one takes: no pages go to and fro between them. */
+/* What one run gives back the next one takes: no pages go to and fro between them, nor modules. */
 void keepMemory() {
   constexpr int kept = 32 << 20; /* the most that malloc allows */
   mallopt(M_MMAP_THRESHOLD, kept);
   mallopt(M_TRIM_THRESHOLD, kept);
+  host::keepUnloadedModules();
 }
 
 void watch(std::chrono::milliseconds patience) {

@@ -75,6 +75,7 @@ class Explorer {
   bool over() const;
 
   int report(const Found &found);
+  std::optional<Failure> playForReport(const Case &failing);
   void print(const Case &failing, const Failure &failure);
   int finish(const std::optional<Found> &found);
   void showProgress();
@@ -278,7 +279,7 @@ int Explorer::playRegressions() {
     const Options written = parseLine(text, defaults_);
     const Case read = caseFrom(written);
     ++played;
-    const auto failure = crew_.alone([&] { play(read, playing_); });
+    const auto failure = playForReport(read);
     if (!failure) continue;
     ++failed;
     std::printf("fails: %s\n%s\n", text.c_str(), failure->text.c_str());
@@ -288,6 +289,14 @@ int Explorer::playRegressions() {
 }
 
 /* ---- What was found -------------------------------------------------------------------------- */
+
+/* Once more, with all that happened: a search keeps no history. */
+std::optional<Failure> Explorer::playForReport(const Case &failing) {
+  return crew_.alone([&] {
+    History::setReportLines(reportLines);
+    play(failing, {.module = playing_.module, .historyLength = reportHistory});
+  });
+}
 
 void Explorer::print(const Case &failing, const Failure &failure) {
   const std::vector<std::string> actors = failing.scenario->actors();
@@ -302,13 +311,7 @@ void Explorer::print(const Case &failing, const Failure &failure) {
     std::printf("  %s fails at its use %u, %u times\n", traits(fault.call).name, fault.nth,
                 fault.count);
 
-  /* Once more, with all that happened. */
-  const auto again = crew_.alone([&] {
-    History::setReportLines(reportLines);
-    Playing whole = playing_;
-    whole.historyLength = reportHistory;
-    play(failing, whole);
-  });
+  const auto again = playForReport(failing);
   std::printf("\n%s\n", (again ? *again : failure).text.c_str());
   if (!again && !crew_.interrupted()) std::printf("It did not fail once more, alone.\n");
   std::printf("Failure: %s\nAgain:   %s %s\n", failure.message.c_str(), defaults_.program.c_str(),
@@ -321,7 +324,7 @@ int Explorer::report(const Found &found) {
               replayOptions(found.failing, options_.length).c_str());
   std::fflush(stdout);
   if (options_.shortenRuns == 0) {
-    std::printf("%s\n", found.failure.text.c_str());
+    print(found.failing, found.failure);
     return kFound;
   }
   Shortener shortener(crew_, playing_,

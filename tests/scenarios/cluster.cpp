@@ -140,7 +140,8 @@ void Cluster::perform(const sim::Operation &operation) {
   const auto [phase, actor, kind, a, b, c] = operation;
   host::Directory &directory = simulation_.directory();
   ++performed_;
-  simulation_.note("operation:", sim::Argument::text(textOf(operation).c_str()));
+  if (simulation_.keepsHistory())
+    simulation_.note("operation:", sim::Argument::text(textOf(operation).c_str()));
   switch (static_cast<Action>(kind % actionCount)) {
     case Action::PutNode:
       return putNode(a, b);
@@ -495,8 +496,7 @@ void Cluster::requireDirectoryTaken() {
 
 /* Each kind of event, counted from the start, agrees with what has happened. */
 void Cluster::requireTraces() {
-  for (const host::TracedRecord &record : host::readTrace()) {
-    if (record.sequence < traceSeen_) continue;
+  for (const host::TracedRecord &record : host::readTrace(traceSeen_)) {
     if (record.sequence != traceSeen_) host::panic("the trace ring is too small for this run");
     ++traceSeen_;
     ++traced_[record.id % std::size(traced_)];

@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <cstring>
+#include <span>
 
 #include "host/kernel/panic.h"
 #include "host/kernel/uuid.h"
@@ -74,8 +75,7 @@ void Lockstep::moduleComesOrGoes() {
 void Lockstep::moduleIsGone() {
   activities_.clear();
   cache_ = nullptr;
-  for (const Known &known : instances_)
-    if (known.alive) host::panic("lockstep: the module is gone, and an instance is not");
+  if (!alive_.empty()) host::panic("lockstep: the module is gone, and an instance is not");
   if (model_ && (!model_->nodes.empty() || !model_->slots.empty() || cacheSubscriptions_ != 0))
     host::panic(
         "lockstep: the module is gone, and %zu nodes, %zu interfaces, %zu subscriptions not",
@@ -84,22 +84,33 @@ void Lockstep::moduleIsGone() {
 }
 
 void Lockstep::moduleIsThere() {
-  activities_.erase(simulation_.scheduler().running().id());
+  end(simulation_.scheduler().running());
 }
 
 /* ---- What fibers do -------------------------------------------------------------------------- */
 
 Lockstep::Activity &Lockstep::begin(const sim::Fiber &fiber, Activity::Kind kind) {
-  Activity &activity = activities_[fiber.id()];
+  Activity *before = find(fiber.id());
+  Activity &activity = before ? *before : activities_.emplace_back();
   activity = Activity{};
+  activity.fiber = fiber.id();
   activity.kind = kind;
   return activity;
 }
 
+Lockstep::Activity *Lockstep::find(uint32_t fiber) {
+  for (Activity &activity : activities_)
+    if (activity.fiber == fiber) return &activity;
+  return nullptr;
+}
+
 Lockstep::Activity *Lockstep::of(const sim::Fiber &fiber) {
-  const auto found = activities_.find(fiber.id());
-  if (found != activities_.end()) return &found->second;
+  if (Activity *activity = find(fiber.id())) return activity;
   return fiber.world ? &begin(fiber, Activity::World) : nullptr;
+}
+
+void Lockstep::end(const sim::Fiber &fiber) {
+  std::erase_if(activities_, [&](const Activity &one) { return one.fiber == fiber.id(); });
 }
 
 void Lockstep::subscriptionCalls(sim::Fiber &fiber, const sim::SubscriptionCall &call) {
@@ -123,7 +134,7 @@ void Lockstep::subscriptionCalls(sim::Fiber &fiber, const sim::SubscriptionCall 
 }
 
 void Lockstep::subscriptionReturned(sim::Fiber &fiber, const sim::SubscriptionCall &call) {
-  Activity &activity = activities_[fiber.id()];
+  Activity &activity = *find(fiber.id());
   const bool cancelled = call.status == ZEL_SUB_CANCELLED;
   switch (activity.kind) {
     case Activity::Nodes:
@@ -137,7 +148,7 @@ void Lockstep::subscriptionReturned(sim::Fiber &fiber, const sim::SubscriptionCa
     default:
       if (!cancelled) objectReturned(activity);
   }
-  activities_.erase(fiber.id());
+  end(fiber);
 }
 
 void Lockstep::statusCalls(sim::Fiber &fiber, uint32_t status) {
@@ -145,17 +156,16 @@ void Lockstep::statusCalls(sim::Fiber &fiber, uint32_t status) {
 }
 
 void Lockstep::statusReturned(sim::Fiber &fiber, uint32_t) {
-  const Activity &activity = activities_[fiber.id()];
+  const Activity &activity = *find(fiber.id());
   const bool enabling = activity.kind == Activity::Enable && !activity.failed;
   if (enabling ? activity.sections != 2 : activity.disabling == 1)
     host::panic("lockstep: a status call has ended half-way");
-  activities_.erase(fiber.id());
+  end(fiber);
 }
 
 model::Instance &Lockstep::creating(const zel_UUID &object, const zel_UUID &node, bool local) {
-  Known &known = instances_.emplace_back();
-  known.instance = std::make_unique<model::Instance>();
-  model::Instance &instance = *known.instance;
+  Known &instance = instances_.emplace_back();
+  alive_.push_back(&instance);
   instance.object = object;
   instance.local = local;
   Activity &activity = begin(simulation_.scheduler().running(), Activity::Create);
@@ -169,13 +179,8 @@ model::Instance &Lockstep::creating(const zel_UUID &object, const zel_UUID &node
   return instance;
 }
 
-Lockstep::Known &Lockstep::known(const model::Instance &instance) {
-  return *std::find_if(instances_.begin(), instances_.end(),
-                       [&](const Known &one) { return one.instance.get() == &instance; });
-}
-
 void Lockstep::created(zel_Status status) {
-  Activity &activity = activities_[simulation_.scheduler().running().id()];
+  Activity &activity = *find(simulation_.scheduler().running().id());
   model::Instance &instance = *activity.instance;
   const bool good = status == ZEL_OK ? !instance.destroyed && !activity.failed
                                      : instance.destroyed || activity.sections == 0;
@@ -187,14 +192,14 @@ void Lockstep::created(zel_Status status) {
     requireResolved(known(instance));
   } else {
     if (activity.sections > 0) ++counts_.destroys;
-    known(instance).alive = false;
+    std::erase(alive_, &known(instance));
   }
-  activities_.erase(simulation_.scheduler().running().id());
+  end(simulation_.scheduler().running());
 }
 
 /* At some time since its first tracking; perhaps by a section that has not ended. */
 void Lockstep::requireResolved(Known &made) KARST_UNCHECKED {
-  for (const model::Answer &one : made.instance->answers)
+  for (const model::Answer &one : made.answers)
     if (one.state == KARST_RESOLVER_STATE_RESOLVED) return;
   if (!made.real || made.real->state != KARST_RESOLVER_STATE_RESOLVED)
     host::panic("lockstep: create succeeded, and the instance never was resolved");
@@ -206,11 +211,11 @@ void Lockstep::destroying(model::Instance &instance) {
 }
 
 void Lockstep::destroyed() {
-  Activity &activity = activities_[simulation_.scheduler().running().id()];
+  Activity &activity = *find(simulation_.scheduler().running().id());
   if (activity.sections != 1) host::panic("lockstep: destroy took %u sections", activity.sections);
   ++counts_.destroys;
-  known(*activity.instance).alive = false;
-  activities_.erase(simulation_.scheduler().running().id());
+  std::erase(alive_, &known(*activity.instance));
+  end(simulation_.scheduler().running());
 }
 
 /* ---- What the platform answers --------------------------------------------------------------- */
@@ -279,7 +284,7 @@ void Lockstep::worldCreated(sim::Fiber &fiber, zel_Status status) {
 void Lockstep::worldWaited(sim::Fiber &fiber, zel_Status status) {
   if (status != ZEL_WORLD_STOPPING) return;
   model_->worldEnds();
-  activities_.erase(fiber.id());
+  end(fiber);
 }
 
 void Lockstep::preemptionAnswered(sim::Fiber &fiber, bool yes) {
@@ -304,7 +309,7 @@ void Lockstep::unlocking(sim::Fiber &fiber, const sim::Spinlock &lock) {
   if (!activity.inputs.empty())
     host::panic("lockstep: %s asked for more than it needs", fiber.name().c_str());
   answersGrew();
-  for (auto &[id, other] : activities_) look(other);
+  for (Activity &other : activities_) look(other);
   compare();
 }
 
@@ -382,8 +387,8 @@ void Lockstep::objectReturned(Activity &activity) {
   model::Instance &instance = *activity.instance;
   if (activity.found) instance.useHint = false;
   /* A destroy may have marked the instance already, and its section not have ended. */
-  const bool ends = std::any_of(activities_.begin(), activities_.end(), [&](const auto &other) {
-    return other.second.kind == Activity::Destroy && other.second.instance == &instance;
+  const bool ends = std::any_of(activities_.begin(), activities_.end(), [&](const Activity &other) {
+    return other.kind == Activity::Destroy && other.instance == &instance;
   });
   if (activity.tracked || activity.mayStay || instance.destroyed || ends) return;
   host::panic("lockstep: an object's call has changed nothing where it should have");
@@ -392,11 +397,11 @@ void Lockstep::objectReturned(Activity &activity) {
 /* ---- What clients see ------------------------------------------------------------------------ */
 
 model::Instance &Lockstep::instanceOf(const void *real) {
-  for (Known &known : instances_)
-    if (known.real == real && known.alive) return *known.instance;
+  for (Known *known : alive_)
+    if (known->real == real) return *known;
   /* Destroyed, with its last calls to come; the newest, since memory is used again. */
   for (auto known = instances_.rbegin(); known != instances_.rend(); ++known)
-    if (known->real == real) return *known->instance;
+    if (known->real == real) return *known;
   host::panic("lockstep: a call for an instance that nobody knows");
 }
 
@@ -411,17 +416,17 @@ size_t Lockstep::saw(model::Instance &instance, size_t from, const model::Answer
 }
 
 void Lockstep::answersGrew() {
-  for (Known &known : instances_) {
-    const std::vector<model::Answer> &answers = known.instance->answers;
-    if (answers.size() == known.answersCounted) continue;
-    counts_.answers += answers.size() - known.answersCounted;
-    known.answersCounted = answers.size();
-    for (const model::Answer &one : known.expected)
+  for (Known *known : alive_) {
+    const std::vector<model::Answer> &answers = known->answers;
+    if (answers.size() == known->answersCounted) continue;
+    counts_.answers += answers.size() - known->answersCounted;
+    known->answersCounted = answers.size();
+    for (const model::Answer &one : known->expected)
       if (one != answers.back())
         host::panic(
             "lockstep: a client saw \"%s\", which the instance never had; it now has \"%s\"",
             one.text().c_str(), answers.back().text().c_str());
-    known.expected.clear();
+    known->expected.clear();
   }
 }
 
@@ -432,8 +437,7 @@ void Lockstep::compare() {
   const zel_UUID cache{};
   require<int>(cache_->enabled, model_->enabled, "enabled", cache);
   size_t inUse = 0;
-  for (uint32_t i = 0; i < KARST_RESOLVER_NODE_POOL_SIZE; i++) {
-    const KARSTResolverNode &real = cache_->nodePool[i];
+  for (const KARSTResolverNode &real : std::span(cache_->nodePool, KARST_RESOLVER_NODE_POOL_SIZE)) {
     if (std::memcmp(real.tag, KARST_RESOLVER_TAG_NODE, sizeof real.tag) != 0) continue;
     ++inUse;
     const auto found = model_->nodes.find(real.uuid);
@@ -479,11 +483,11 @@ void Lockstep::compareNode(const model::Node &node, const KARSTResolverNode &rea
        link = link->next)
     if (KARST_RESOLVER_CONTAINER(link, KARSTResolverNetIf, nodeLinks)->uuid != (*netIf++)->uuid)
       host::panic("lockstep: the interfaces of %s are out of order", name(uuid).c_str());
-  compareInstances({node.instances.begin(), node.instances.end()}, real.instanceList);
-  model::Answer set = model::Answer::of(node.set.state, real.locators);
-  if (set != node.set)
+  compareInstances(node.instances, real.instanceList);
+  if (!node.set.is(node.set.state, real.locators))
     host::panic("lockstep: the locators of %s are \"%s\", and should be \"%s\"", name(uuid).c_str(),
-                set.text().c_str(), node.set.text().c_str());
+                model::Answer::of(node.set.state, real.locators).text().c_str(),
+                node.set.text().c_str());
 }
 
 void Lockstep::compareNetIf(const model::NetIf &netIf, const KARSTResolverNetIf &real) {
@@ -506,50 +510,49 @@ void Lockstep::compareInstances(const std::vector<model::Instance *> &instances,
   for (const KARSTResolverLink *link = head.next; link != &head; link = link->next) {
     if (instance == instances.end())
       host::panic("lockstep: a node has more instances than it should");
-    compareInstance(**instance++,
+    compareInstance(known(**instance++),
                     *KARST_RESOLVER_CONTAINER(link, KARSTResolverInstance, nodeLinks));
   }
   if (instance != instances.end())
     host::panic("lockstep: a node has fewer instances than it should");
 }
 
-void Lockstep::compareInstance(model::Instance &instance, KARSTResolverInstance &real) {
-  Known &seen = known(instance);
-  if (!seen.real) seen.real = &real; /* its first attachment */
-  if (seen.real != &real) host::panic("lockstep: a node's instances are out of order");
+void Lockstep::compareInstance(Known &instance, KARSTResolverInstance &real) {
+  if (!instance.real) instance.real = &real; /* its first attachment */
+  if (instance.real != &real) host::panic("lockstep: a node's instances are out of order");
   require<int>(real.nodeChanged, instance.changed, "nodeChanged", instance.bound);
   if (real.boundNodeUUID != instance.bound || real.node->uuid != instance.node->uuid)
     host::panic("lockstep: an instance is bound elsewhere");
-  const model::Answer answer = model::Answer::of(real.state, real.locators);
-  if (answer != instance.answer)
-    host::panic("lockstep: an instance answers \"%s\", and should \"%s\"", answer.text().c_str(),
-                instance.answer.text().c_str());
+  requireAnswer(instance);
+}
+
+void Lockstep::requireAnswer(const Known &instance) KARST_UNCHECKED {
+  const KARSTResolverInstance &real = *instance.real;
+  if (!instance.answer().is(real.state, real.locators))
+    host::panic("lockstep: an instance answers \"%s\", and should \"%s\"",
+                model::Answer::of(real.state, real.locators).text().c_str(),
+                instance.answer().text().c_str());
 }
 
 /* ---- At rest --------------------------------------------------------------------------------- */
 
 void Lockstep::atRest() {
-  for (const auto &[id, activity] : activities_)
+  for (const Activity &activity : activities_)
     if (activity.kind != Activity::World)
       host::panic("lockstep: a fiber is still inside the module");
   if (!cache_) return;
   compare();
   const zel_UUID cache{};
-  size_t alive = 0;
-  for (const Known &known : instances_) {
+  for (const Known &known : instances_)
     if (!known.expected.empty())
       host::panic("lockstep: a client saw \"%s\", which the instance never had",
                   known.expected.front().text().c_str());
-    if (!known.alive) continue;
-    ++alive;
-    const model::Answer answer = model::Answer::of(known.real->state, known.real->locators);
-    if (answer != known.instance->answer)
-      host::panic("lockstep: an instance answers \"%s\", and should \"%s\"", answer.text().c_str(),
-                  known.instance->answer.text().c_str());
-    require<uint64_t>(known.real->refCount, host::isZero(known.instance->object) ? 1 : 2,
-                      "references of an instance", known.instance->bound);
+  for (const Known *known : alive_) {
+    requireAnswer(*known);
+    require<uint64_t>(known->real->refCount, host::isZero(known->object) ? 1 : 2,
+                      "references of an instance", known->bound);
   }
-  require<uint64_t>(cache_->refCount, cacheSubscriptions_ + model_->healthSubscriptions() + alive,
+  require<uint64_t>(cache_->refCount, cacheSubscriptions_ + model_->followed.size() + alive_.size(),
                     "references of the cache", cache);
   require(lengthOf(cache_->freeNodes), KARST_RESOLVER_NODE_POOL_SIZE - model_->nodes.size(),
           "free nodes", cache);

@@ -5,7 +5,7 @@
  */
 #pragma once
 
-#include <map>
+#include <deque>
 #include <optional>
 
 #include "karst_resolver/model.h"
@@ -66,6 +66,7 @@ class Lockstep final : public sim::Observer {
  private:
   /* What a fiber does inside the module. */
   struct Activity {
+    uint32_t fiber = 0;
     enum Kind { Nodes, NetIfs, Health, Object, Enable, Disable, World, Create, Destroy };
     Kind kind = Nodes;
     KarstEntryHeader header{};
@@ -84,16 +85,16 @@ class Lockstep final : public sim::Observer {
     unsigned disabling = 0;
   };
 
-  struct Known {
-    std::unique_ptr<model::Instance> instance;
+  struct Known : model::Instance {
     KARSTResolverInstance *real = nullptr; /* once the module has shown it */
     std::vector<model::Answer> expected;   /* seen, and still to come */
     size_t answersCounted = 1;
-    bool alive = true;
   };
 
   Activity &begin(const sim::Fiber &fiber, Activity::Kind kind);
   Activity *of(const sim::Fiber &fiber);
+  Activity *find(uint32_t fiber);
+  void end(const sim::Fiber &fiber);
   void step(Activity &activity);
   void stepEnable(Activity &activity);
   void stepDisable(Activity &activity);
@@ -108,16 +109,18 @@ class Lockstep final : public sim::Observer {
   void compareNetIf(const model::NetIf &netIf, const KARSTResolverNetIf &real);
   void compareInstances(const std::vector<model::Instance *> &instances,
                         const KARSTResolverLink &head);
-  void compareInstance(model::Instance &instance, KARSTResolverInstance &real);
+  void compareInstance(Known &instance, KARSTResolverInstance &real);
+  static void requireAnswer(const Known &instance);
   model::Instance &instanceOf(const void *real);
-  Known &known(const model::Instance &instance);
+  static Known &known(model::Instance &instance) { return static_cast<Known &>(instance); }
   void requireResolved(Known &made);
 
   sim::Simulation &simulation_;
   std::unique_ptr<model::Resolver> model_;
   KARSTResolverCache *cache_ = nullptr;
-  std::map<uint32_t, Activity> activities_; /* by fiber */
-  std::vector<Known> instances_;
+  std::vector<Activity> activities_; /* one a fiber */
+  std::deque<Known> instances_;      /* all that there ever were */
+  std::vector<Known *> alive_;
   size_t cacheSubscriptions_ = 0; /* of nodes and interfaces, whose last call has not returned */
   uint64_t checks_ = 0, sections_ = 0;
   Counts counts_;

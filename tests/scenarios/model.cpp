@@ -10,25 +10,34 @@
 
 namespace model {
 
-bool UUIDOrder::operator()(const zel_UUID &left, const zel_UUID &right) const {
-  uint64_t l[2], r[2];
-  std::memcpy(l, left.bytes, sizeof l);
-  std::memcpy(r, right.bytes, sizeof r);
-  return l[0] != r[0] ? l[0] < r[0] : l[1] < r[1];
-}
-
 /* ---- Answers --------------------------------------------------------------------------------- */
 
 Answer Answer::of(uint32_t state, const KARSTResolverNodeLocators &set) {
   Answer answer{state, set.nodeUUID, set.majorVersion, set.minorVersion, set.trafficType, {}};
   for (uint16_t i = 0; i < set.count; i++) {
     const KARSTResolverNodeLocator &locator = set.locators[i];
-    const size_t length = locator.networkType == KARST_RESOLVER_LOCATOR_IPV6   ? 16
-                          : locator.networkType == KARST_RESOLVER_LOCATOR_IPV4 ? 4
-                                                                               : 0;
-    answer.locators.push_back({locator.networkType, {locator.address, locator.address + length}});
+    answer.locators.push_back(Locator::of(locator.networkType, locator.address));
   }
   return answer;
+}
+
+Answer::Locator Answer::Locator::of(uint32_t type, const uint8_t *address) {
+  Locator locator{type, {}};
+  const size_t length = type == KARST_RESOLVER_LOCATOR_IPV6   ? 16
+                        : type == KARST_RESOLVER_LOCATOR_IPV4 ? 4
+                                                              : 0;
+  std::memcpy(locator.address.data(), address, length);
+  return locator;
+}
+
+/* Equal to of(...), which takes memory. */
+bool Answer::is(uint32_t real, const KARSTResolverNodeLocators &set) const {
+  return state == real && node == set.nodeUUID && major == set.majorVersion &&
+         minor == set.minorVersion && trafficType == set.trafficType &&
+         std::equal(locators.begin(), locators.end(), set.locators, set.locators + set.count,
+                    [](const Locator &own, const KARSTResolverNodeLocator &other) {
+                      return own == Locator::of(other.networkType, other.address);
+                    });
 }
 
 std::string Answer::text() const {
@@ -45,11 +54,14 @@ std::string Answer::text() const {
 /* ---- Inputs ---------------------------------------------------------------------------------- */
 
 Input Inputs::take(Input::Kind kind, uint8_t type, const zel_UUID &uuid) {
-  if (queue_.empty())
+  if (empty())
     host::panic("model: the module did not ask for kind %d, type %u, %s", kind, type,
                 host::toString(uuid).c_str());
-  Input input = std::move(queue_.front());
-  queue_.pop_front();
+  Input input = std::move(queue_[taken_++]);
+  if (empty()) {
+    queue_.clear();
+    taken_ = 0;
+  }
   if (input.kind != kind || input.type != type || input.uuid != uuid)
     host::panic("model: the module asked for kind %d, type %u, %s in place of kind %d, type %u, %s",
                 input.kind, input.type, host::toString(input.uuid).c_str(), kind, type,
@@ -85,7 +97,7 @@ void Resolver::mark(Node &node) {
 
 void Resolver::release(Node *node) {
   if (--node->references != 0) return;
-  if (node->dirty) dirty.remove(node);
+  if (node->dirty) std::erase(dirty, node);
   nodes.erase(node->uuid);
 }
 
@@ -165,7 +177,9 @@ NetIf *Resolver::findOrCreateNetIf(const zel_UUID &owner, const zel_UUID &uuid, 
   }
   Node *node = findOrCreate(owner);
   if (!node) return nullptr;
-  NetIf *netIf = slots.emplace_back(std::make_unique<NetIf>()).get();
+  auto made = std::make_unique<NetIf>();
+  NetIf *netIf = made.get();
+  slots[netIf] = std::move(made);
   netIf->uuid = uuid;
   netIf->node = node;
   netIfs.push_back(netIf);
@@ -204,14 +218,13 @@ void Resolver::updateHealth(NetIf &netIf, Inputs &inputs) {
 }
 
 void Resolver::releaseNetIf(NetIf &netIf) {
-  if (--netIf.references != 0) return;
-  slots.remove_if([&](const auto &slot) { return slot.get() == &netIf; });
+  if (--netIf.references == 0) slots.erase(&netIf);
 }
 
 void Resolver::destroyNetIf(NetIf &netIf) {
   Node *node = netIf.node;
-  netIfs.remove(&netIf);
-  node->netIfs.remove(&netIf);
+  std::erase(netIfs, &netIf);
+  std::erase(node->netIfs, &netIf);
   mark(*node);
   release(node);
   netIf.node = nullptr;
@@ -241,26 +254,21 @@ void Resolver::rescanNetIfs(Inputs &inputs) {
       destroyNetIf(*netIf);
     }
   }
-  const std::list<NetIf *> all = netIfs;
+  const std::vector<NetIf *> all = netIfs;
   for (NetIf *netIf : all)
     if (!std::exchange(netIf->seen, false)) destroyNetIf(*netIf);
 }
 
 void Resolver::healthCall(const void *data, zel_Status status, Inputs &inputs) {
-  const auto found = std::find_if(slots.begin(), slots.end(),
-                                  [=](const auto &slot) { return slot->data == data; });
-  if (found == slots.end()) host::panic("model: a health call for an interface that is gone");
+  const auto found = followed.find(data);
+  if (found == followed.end()) host::panic("model: a health call for an interface that is gone");
+  NetIf &netIf = *found->second;
   if (status == ZEL_SUB_CANCELLED) {
-    (*found)->data = nullptr;
-    releaseNetIf(**found);
-  } else if ((*found)->node) {
-    updateHealth(**found, inputs);
+    followed.erase(found);
+    releaseNetIf(netIf);
+  } else if (netIf.node) {
+    updateHealth(netIf, inputs);
   }
-}
-
-size_t Resolver::healthSubscriptions() const {
-  return static_cast<size_t>(std::count_if(slots.begin(), slots.end(),
-                                           [](const auto &slot) { return slot->data != nullptr; }));
 }
 
 /* ---- Locators -------------------------------------------------------------------------------- */
@@ -279,16 +287,12 @@ void Resolver::generate(Node &node) {
     if (info.networkType != KARST_NETWORK_TYPE_IP) continue;
     const uint8_t *single = info.ipv4Address;
     if (info.numIpAddresses == 0 && (single[0] | single[1] | single[2] | single[3]))
-      set.locators.push_back({KARST_RESOLVER_LOCATOR_IPV4, {single, single + 4}});
+      set.locators.push_back(Answer::Locator::of(KARST_RESOLVER_LOCATOR_IPV4, single));
     for (uint32_t i = 0; i < std::min(info.numIpAddresses, 7u); i++) {
       const KarstIpAddress &address = info.ipAddresses[i];
-      if (address.isIPv6) {
-        set.locators.push_back(
-            {KARST_RESOLVER_LOCATOR_IPV6, {address.address, address.address + 16}});
-      } else {
-        set.locators.push_back(
-            {KARST_RESOLVER_LOCATOR_IPV4, {address.address, address.address + 4}});
-      }
+      set.locators.push_back(Answer::Locator::of(
+          address.isIPv6 ? KARST_RESOLVER_LOCATOR_IPV6 : KARST_RESOLVER_LOCATOR_IPV4,
+          address.address));
     }
   }
   if (set.locators.size() > KARST_RESOLVER_MAX_LOCATORS)
@@ -306,7 +310,6 @@ void Resolver::updateAnswer(Instance &instance) {
     answer = node->set;
     answer.state = KARST_RESOLVER_STATE_RESOLVED;
   }
-  instance.answer = answer;
   instance.answers.push_back(std::move(answer));
 }
 
@@ -318,7 +321,7 @@ void Resolver::installHealth(Inputs &inputs) {
     const Input made = inputs.take(Input::Subscribed, KARST_TYPE_HEALTH_STATUS, netIf->uuid);
     if (made.status != ZEL_OK) continue;
     netIf->watched = true;
-    netIf->data = made.data;
+    followed[made.data] = netIf;
     ++netIf->references;
   }
 }
@@ -336,8 +339,7 @@ void Resolver::workOff(Inputs &inputs) {
     if (node->instances.empty()) continue;
     ++node->references;
     refreshing = node;
-    pending.assign(node->instances.begin(), node->instances.end());
-    node->instances.clear();
+    pending = std::exchange(node->instances, {});
     current_ = pending.front();
     stage_ = Stage::Refresh;
     return;
@@ -357,8 +359,8 @@ void Resolver::worldSection(Inputs &inputs) {
     case Stage::Resume:
       if (current_->node == refreshing) {
         std::erase(pending, current_);
-        refreshing->instances.remove(current_);
-        refreshing->instances.push_front(current_);
+        std::erase(refreshing->instances, current_);
+        refreshing->instances.insert(refreshing->instances.begin(), current_);
       }
       if (!pending.empty()) {
         current_ = pending.front();
@@ -384,7 +386,7 @@ bool Resolver::tracksAlready(const Instance &instance, const zel_UUID &uuid) {
 
 void Resolver::leave(Instance &instance) {
   std::erase(pending, &instance);
-  instance.node->instances.remove(&instance);
+  std::erase(instance.node->instances, &instance);
   release(std::exchange(instance.node, nullptr));
 }
 
@@ -398,7 +400,7 @@ void Resolver::track(Instance &instance, const zel_UUID &uuid) {
   if (instance.node) leave(instance);
   if (attach) {
     if (Node *node = findOrCreate(uuid)) {
-      node->instances.push_front(&instance);
+      node->instances.insert(node->instances.begin(), &instance);
       ++node->references;
       instance.node = node;
       instance.bound = uuid;
@@ -424,7 +426,7 @@ void Resolver::forgetEntries() {
     Node &node = *(it++)->second;
     setReachable(node, false);
   }
-  const std::list<NetIf *> all = netIfs;
+  const std::vector<NetIf *> all = netIfs;
   for (NetIf *netIf : all) destroyNetIf(*netIf);
 }
 

@@ -5,8 +5,9 @@
  */
 #pragma once
 
+#include <array>
+#include <cstring>
 #include <deque>
-#include <list>
 #include <map>
 #include <memory>
 #include <string>
@@ -20,7 +21,12 @@ namespace model {
 
 /* In the order of the module's tree: two little-endian halves. */
 struct UUIDOrder {
-  bool operator()(const zel_UUID &left, const zel_UUID &right) const;
+  bool operator()(const zel_UUID &left, const zel_UUID &right) const {
+    uint64_t l[2], r[2];
+    std::memcpy(l, left.bytes, sizeof l);
+    std::memcpy(r, right.bytes, sizeof r);
+    return l[0] != r[0] ? l[0] < r[0] : l[1] < r[1];
+  }
 };
 
 /* What a client can see of a node or an instance. */
@@ -31,11 +37,13 @@ struct Answer {
   uint64_t trafficType = 0;
   struct Locator {
     uint32_t type;
-    std::vector<uint8_t> address; /* the meaningful bytes */
+    std::array<uint8_t, 16> address; /* zeros behind the bytes that have a meaning */
+    static Locator of(uint32_t type, const uint8_t *address);
     bool operator==(const Locator &) const = default;
   };
   std::vector<Locator> locators;
 
+  bool is(uint32_t state, const KARSTResolverNodeLocators &set) const;
   static Answer of(uint32_t state, const KARSTResolverNodeLocators &set);
   bool operator==(const Answer &) const = default;
   std::string text() const;
@@ -52,15 +60,14 @@ struct NetIf {
   bool watched = false;
   bool seen = false;
   unsigned references = 1;
-  const void *data = nullptr; /* of its health subscription, until the last call */
 };
 
 struct Instance {
   zel_UUID object{}, hint{}, bound{};
   bool useHint = false, local = false, changed = false, destroyed = false;
   Node *node = nullptr;
-  Answer answer;                         /* what a client reads now */
   std::vector<Answer> answers{Answer{}}; /* all that could ever be read, oldest first */
+  const Answer &answer() const { return answers.back(); } /* what a client reads now */
 };
 
 struct Node {
@@ -69,8 +76,8 @@ struct Node {
   bool news = false; /* a new version or witness flag, which waits for the next change */
   uint32_t major = 0, minor = 0;
   unsigned references = 0;
-  std::list<NetIf *> netIfs;
-  std::list<Instance *> instances;
+  std::vector<NetIf *> netIfs;
+  std::vector<Instance *> instances;
   Answer set; /* its locators; the state is not used */
 };
 
@@ -88,13 +95,13 @@ struct Input {
 class Inputs {
  public:
   void add(Input input) { queue_.push_back(std::move(input)); }
-  bool empty() const { return queue_.empty(); }
-  void clear() { queue_.clear(); }
+  bool empty() const { return taken_ == queue_.size(); }
   Input take(Input::Kind kind, uint8_t type,
              const zel_UUID &uuid); /* another one: stops the system */
 
  private:
-  std::deque<Input> queue_;
+  std::vector<Input> queue_;
+  size_t taken_ = 0;
 };
 
 class Resolver {
@@ -129,11 +136,11 @@ class Resolver {
   bool refused = false; /* for want of a slot, now or before */
   zel_UUID self{};
   std::map<zel_UUID, std::unique_ptr<Node>, UUIDOrder> nodes;
-  std::list<NetIf *> netIfs; /* live ones, oldest first */
-  std::list<Node *> dirty;
-  std::list<std::unique_ptr<NetIf>> slots; /* live ones, and those whose last call is due */
-  size_t healthSubscriptions() const;      /* whose last call has not come */
-  std::vector<Instance *> pending;         /* that the world has moved aside, front first */
+  std::vector<NetIf *> netIfs; /* live ones, oldest first */
+  std::deque<Node *> dirty;
+  std::map<NetIf *, std::unique_ptr<NetIf>> slots; /* live ones, and whose last call is due */
+  std::map<const void *, NetIf *> followed;        /* by a health subscription, to its last call */
+  std::vector<Instance *> pending;                 /* that the world has moved aside, front first */
   Node *refreshing = nullptr;
 
  private:

@@ -29,8 +29,8 @@ struct Profile {
   const char *name;
   const char *about;
   std::vector<Actor> actors;
-  size_t length = 200;
-  unsigned phases = 3;
+  size_t length = 400;
+  unsigned phases = 4;
   unsigned faults = 0;       /* most that are planned */
   unsigned callbackWork = 2; /* scheduling points */
   bool preemption = true;
@@ -148,30 +148,30 @@ std::vector<Profile> profiles() {
   table.push_back({.name = "events",
                    .about = "every kind of entry comes, changes, goes, and is lost in overflows",
                    .actors = {nodes, netIfs, netIfs, objects, trouble, one},
-                   .length = 300,
+                   .length = 600,
                    .queueBound = 2});
   table.push_back({.name = "crowd",
                    .about = "more nodes and interfaces than there are slots",
                    .actors = {floods, netIfs, one, rareLoader},
                    .length = 24,
+                   .phases = 3,
                    .queueBound = 64,
                    .traceSlots = 1 << 15});
   table.push_back({.name = "churn",
                    .about = "instances come and go under callbacks that take long",
                    .actors = {one, two, {"caller-3", 4, callers}, nodes, netIfs, trouble},
-                   .length = 300,
+                   .length = 600,
                    .callbackWork = 12});
   table.push_back({.name = "moves",
                    .about = "objects change owners while their instances are refreshed",
                    .actors = {objects, objects, netIfs, one, two},
-                   .length = 240});
+                   .length = 480});
   table.push_back({.name = "readers",
                    .about = "several readers of the same instances, and writers",
                    .actors = {reader, reader, {"reader-3", 3, readers}, netIfs, nodes, one}});
   table.push_back({.name = "faults",
                    .about = "platform calls fail at any moment, and everything else goes on",
                    .actors = {nodes, netIfs, objects, status, loader, one, two, trouble},
-                   .length = 200,
                    .faults = 6});
 
   for (Profile &small : smallProfiles()) table.push_back(std::move(small));

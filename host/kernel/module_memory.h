@@ -1,0 +1,33 @@
+/* The memory of a mapped module that is kept between an unload and the next load: out of reach
+ * meanwhile, and then as it was when the dynamic linker had just filled it in. No lock.
+ */
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <string>
+#include <vector>
+
+namespace host {
+
+class ModuleMemory {
+ public:
+  /* Takes the memory as it is now for what it begins with. */
+  ModuleMemory(uintptr_t base, size_t size);
+
+  void withdraw() const; /* who reads, writes or runs it from here on crashes */
+  void reveal() const;   /* it can be read, for a report */
+  void renew() const;    /* as at first: its variables, and what can be done with it */
+
+ private:
+  struct Pages {
+    uintptr_t begin;
+    size_t size;
+    int protection;
+    std::string content; /* of what can be written */
+  };
+
+  std::vector<Pages> pages_; /* one behind the other, without a gap */
+};
+
+}  // namespace host

@@ -55,6 +55,10 @@ Subject subjectOf(const std::string &name) {
   return {name.substr(0, end), name.substr(end + SEPARATOR.size())};
 }
 
+void notMeasured(const Subject &subject, const std::string &why) {
+  registry().notMeasured[subject] = why;
+}
+
 void percentiles(benchmark::State &state, std::vector<double> &nanoseconds) {
   std::sort(nanoseconds.begin(), nanoseconds.end());
   state.counters[P50] = nanoseconds[nanoseconds.size() / 2];

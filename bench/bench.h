@@ -38,6 +38,9 @@ inline std::string limit(const std::string &what) {
   return "limit: " + what;
 }
 
+/* The subject cannot be measured on this machine, and why. */
+void notMeasured(const Subject &subject, const std::string &why);
+
 /* A benchmark whose time is that of so many pieces of work sets this counter: figures are for one. */
 inline constexpr const char *ITEMS = "items";
 

@@ -98,6 +98,10 @@ void Figures::print() const {
     }
     std::printf("\n");
   }
+  for (const auto &[subject, why] : registry().notMeasured) {
+    std::printf("%-36s %-36s not measured: %s\n", subject.work.c_str(), subject.who.c_str(),
+                why.c_str());
+  }
   for (const Statement &said : registry().statements) {
     std::printf("%-73s %11.0f %s\n", said.text.c_str(), said.value, said.unit.c_str());
   }
@@ -124,6 +128,9 @@ nlohmann::ordered_json Figures::json() const {
                               {"who", subject.who},
                               {"nanoseconds", figure.nanoseconds},
                               {"spread_percent", figure.spreadPercent}});
+  }
+  for (const auto &[subject, why] : registry().notMeasured) {
+    all["not_measured"].push_back({{"work", subject.work}, {"who", subject.who}, {"why", why}});
   }
   for (const Verdict &verdict : verdicts()) {
     if (!verdict.measured()) continue;

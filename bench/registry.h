@@ -1,6 +1,7 @@
 /* What has been said with the functions of bench.h, for the figures to be judged by. */
 #pragma once
 
+#include <map>
 #include <string>
 #include <vector>
 
@@ -20,7 +21,8 @@ struct Statement {
 };
 
 struct Registry {
-  std::vector<Subject> subjects; /* in the order in which they were first named */
+  std::vector<Subject> subjects;              /* in the order in which they were first named */
+  std::map<Subject, std::string> notMeasured; /* and why */
   std::vector<Bar> bars;
   std::vector<Count> counts;
   std::vector<Statement> statements;

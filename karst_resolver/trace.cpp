@@ -20,44 +20,43 @@ void KARSTResolverTraceInit(void) {
 /* Site numbers of the two throttle notices. */
 enum { SITE_PER_EVENT_NOTICE = 407, SITE_GLOBAL_NOTICE = 430 };
 
-/* What goes into one record. */
-struct KARSTResolverTraceContent {
-  uint32_t type;
-  uint32_t id;
-  uint32_t siteNumber;
-  const uint64_t *payload;
-};
-
-/* A masked update of some bits of a word. The record is in a ring that readers read at the same
- * time: every store is a whole word, in the order written here. */
-static void KARSTResolverTraceSetBits(uint64_t *word, uint32_t shift, uint32_t width,
-                                      uint64_t value) {
+/* A masked update of some bits of a word of the record, which readers read at the same time: every
+ * store is a whole word, and they are made in the order written here. Nobody else writes the record
+ * in this lap, so that a word's other bits are those that were stored or found last. */
+static void KARSTResolverTraceSetBits(uint64_t *word, uint64_t *known, uint32_t shift,
+                                      uint32_t width, uint64_t value) {
   uint64_t mask = ((1ull << width) - 1) << shift;
-  uint64_t old = __atomic_load_n(word, __ATOMIC_RELAXED);
-  __atomic_store_n(word, (old & ~mask) | ((value << shift) & mask), __ATOMIC_RELAXED);
+  *known = (*known & ~mask) | ((value << shift) & mask);
+  __atomic_store_n(word, *known, __ATOMIC_RELAXED);
 }
 
-static void KARSTResolverTraceWrite(TraceStream *stream, const KARSTResolverTraceContent *content) {
+/* A function of its own, as is KARSTResolverTraceEmitThrottled: what they save of their caller's
+ * registers, an event that goes no further than Emit is not to pay for. */
+static __attribute__((noinline)) void KARSTResolverTraceWrite(TraceStream *stream, uint64_t kind,
+                                                              const uint64_t payload[6]) {
   uint64_t sequence = __atomic_fetch_add(&stream->sequence, 1, __ATOMIC_RELAXED);
   TraceRecord *ring = (TraceRecord *)((uint8_t *)stream + TRACE_STREAM_RING);
   TraceRecord *record = &ring[sequence & stream->mask];
+  __builtin_prefetch(record, 1); /* a lap old: on its way while the clock is read */
 
   uint64_t processor = tolmapi_GetPCPUNumPreemptible();
   uint64_t nanoseconds = zel_TimerTCToNS(zel_GetTimerCycles());
 
-  KARSTResolverTraceSetBits(&record->word1, 35, 29, sequence);
-  KARSTResolverTraceSetBits(&record->word0, 1, 8, processor);
-  KARSTResolverTraceSetBits(&record->word1, 0, 6, content->type);
-  KARSTResolverTraceSetBits(&record->word1, 6, 14, content->id);
-  KARSTResolverTraceSetBits(&record->word1, 20, 15, content->siteNumber);
-  KARSTResolverTraceSetBits(&record->word0, 9, 55, nanoseconds);
-  for (int i = 0; i < 6; i++) {
-    __atomic_store_n(&record->payload[i], content->payload[i], __ATOMIC_RELAXED);
-  }
+  uint64_t word0 = __atomic_load_n(&record->word0, __ATOMIC_RELAXED);
+  uint64_t word1 = __atomic_load_n(&record->word1, __ATOMIC_RELAXED);
+  KARSTResolverTraceSetBits(&record->word1, &word1, 35, 29, sequence);
+  KARSTResolverTraceSetBits(&record->word0, &word0, 1, 8, processor);
+  KARSTResolverTraceSetBits(&record->word1, &word1, 0, 35, kind); /* neighbours: at once */
+  KARSTResolverTraceSetBits(&record->word0, &word0, 9, 55, nanoseconds);
+  __atomic_store_n(&record->payload[0], payload[0], __ATOMIC_RELAXED);
+  __atomic_store_n(&record->payload[1], payload[1], __ATOMIC_RELAXED);
+  __atomic_store_n(&record->payload[2], payload[2], __ATOMIC_RELAXED);
+  __atomic_store_n(&record->payload[3], payload[3], __ATOMIC_RELAXED);
+  __atomic_store_n(&record->payload[4], payload[4], __ATOMIC_RELAXED);
+  __atomic_store_n(&record->payload[5], payload[5], __ATOMIC_RELAXED);
 
   /* Last, and released: a reader that sees this lap's phase sees the whole record. */
   uint64_t phase = ~(sequence >> stream->lapShift) & 1;
-  uint64_t word0 = __atomic_load_n(&record->word0, __ATOMIC_RELAXED);
   __atomic_store_n(&record->word0, (word0 & ~1ull) | phase, __ATOMIC_RELEASE);
 
   uint64_t notifyHandle = __atomic_load_n(&stream->notifyHandle, __ATOMIC_RELAXED);
@@ -66,31 +65,43 @@ static void KARSTResolverTraceWrite(TraceStream *stream, const KARSTResolverTrac
   if (sequence % TRACE_NOTIFY_EVERY == 0) Trace_Notify(notifyHandle);
 }
 
-void KARSTResolverTraceEmit(TokenBucketMini *bucket, uint32_t id, uint32_t siteNumber,
-                            const uint64_t payload[6]) {
+static uint64_t KARSTResolverTraceNoticeKind(uint32_t id, uint32_t siteNumber) {
+  return KARST_RESOLVER_TRACE_KIND(TRACE_RECORD_THROTTLE, id, siteNumber);
+}
+
+/* The two buckets, an event's and the stream's. A bucket's last token is for a notice in the event's
+ * place. */
+static __attribute__((noinline)) void KARSTResolverTraceEmitThrottled(TraceStream *stream,
+                                                                      TokenBucketMini *bucket,
+                                                                      uint64_t kind,
+                                                                      const uint64_t payload[6]) {
+  uint64_t left;
+  if (!TokenBucket_UseTokensMini(bucket, perTraceTbConfig, 1, &left)) return;
+  uint64_t notice[6] = {};
+  if (left == 0) { /* say that this event is being suppressed */
+    notice[0] = TokenBucket_TimeToGetTokens(bucket);
+    notice[1] = kind & 0xfffff; /* its type and id */
+    kind = KARSTResolverTraceNoticeKind(Trace_GetPerTraceThrottledTraceId(), SITE_PER_EVENT_NOTICE);
+    payload = notice;
+  }
+  if (!TokenBucket_UseTokens(&stream->globalBucket, 1, &left)) return;
+  if (left == 0) { /* the whole stream is: that matters more than any one event */
+    notice[0] = TokenBucket_TimeToGetTokens(&stream->globalBucket);
+    notice[1] = 0;
+    kind = KARSTResolverTraceNoticeKind(Trace_GetGlobalThrottledTraceId(), SITE_GLOBAL_NOTICE);
+    payload = notice;
+  }
+  KARSTResolverTraceWrite(stream, kind, payload);
+}
+
+void KARSTResolverTraceEmit(TokenBucketMini *bucket, uint64_t kind, const uint64_t payload[6]) {
   TraceStream *stream = (TraceStream *)traceStreamTables[1];
   if (!(__atomic_load_n(&stream->flags, __ATOMIC_RELAXED) & TRACE_STREAM_ENABLED)) return;
-
-  KARSTResolverTraceContent content = {TRACE_RECORD_EVENT, id, siteNumber, payload};
-  uint64_t notice[6] = {};
   if (__atomic_load_n(&stream->throttling, __ATOMIC_RELAXED)) {
-    uint64_t left;
-    if (!TokenBucket_UseTokensMini(bucket, perTraceTbConfig, 1, &left)) return;
-    if (left == 0) { /* this event's last token: say that it is being suppressed */
-      notice[0] = TokenBucket_TimeToGetTokens(bucket);
-      notice[1] = (uint64_t)id << 6 | TRACE_RECORD_EVENT;
-      content = {TRACE_RECORD_THROTTLE, Trace_GetPerTraceThrottledTraceId(), SITE_PER_EVENT_NOTICE,
-                 notice};
-    }
-    if (!TokenBucket_UseTokens(&stream->globalBucket, 1, &left)) return;
-    if (left == 0) { /* the stream's last: that matters more than any one event */
-      notice[0] = TokenBucket_TimeToGetTokens(&stream->globalBucket);
-      notice[1] = 0;
-      content = {TRACE_RECORD_THROTTLE, Trace_GetGlobalThrottledTraceId(), SITE_GLOBAL_NOTICE,
-                 notice};
-    }
+    KARSTResolverTraceEmitThrottled(stream, bucket, kind, payload);
+  } else {
+    KARSTResolverTraceWrite(stream, kind, payload);
   }
-  KARSTResolverTraceWrite(stream, &content);
 }
 
 } /* extern "C" */

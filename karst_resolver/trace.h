@@ -41,9 +41,9 @@ KARST_RESOLVER_TRACE_EVENTS(KARST_RESOLVER_TRACE_DECLARE)
 /* Fills the buckets, in order. Once, before anything is emitted. */
 void KARSTResolverTraceInit(void);
 
-/* Steps from the stream on: throttles and writes at most one record. */
-void KARSTResolverTraceEmit(TokenBucketMini *bucket, uint32_t id, uint32_t siteNumber,
-                            const uint64_t payload[6]);
+/* Steps from the stream on: throttles and writes at most one record. `kind` is what its word 1 holds
+ * besides the sequence number. */
+void KARSTResolverTraceEmit(TokenBucketMini *bucket, uint64_t kind, const uint64_t payload[6]);
 
 } /* extern "C" */
 
@@ -56,16 +56,23 @@ void KARSTResolverTraceEmit(TokenBucketMini *bucket, uint32_t id, uint32_t siteN
 KARST_RESOLVER_TRACE_EVENTS(KARST_RESOLVER_TRACE_CONSTANTS)
 #undef KARST_RESOLVER_TRACE_CONSTANTS
 
+/* Type, trace id and site number of a record. */
+#define KARST_RESOLVER_TRACE_KIND(type, id, siteNumber) \
+  ((type) | (uint64_t)((id)&0x3fff) << 6 | (uint64_t)((siteNumber)&0x7fff) << 20)
+
 /* Emits an event from the trace statement `siteNumber`; up to six 64-bit payload words, the rest is
  * zero. */
-#define KARST_RESOLVER_TRACE(event, siteNumber, ...)                                          \
-  do {                                                                                        \
-    if (Trace_ClassLevelGet(KARST_RESOLVER_TRACE_CLASS_##event) >=                            \
-        KARST_RESOLVER_TRACE_LEVEL_##event) {                                                 \
-      const uint64_t tracePayload[6] = {__VA_ARGS__};                                         \
-      KARSTResolverTraceEmit(&KARSTResolverTrace##event##Tb, KARST_RESOLVER_TRACE_ID_##event, \
-                             siteNumber, tracePayload);                                       \
-    }                                                                                         \
+#define KARST_RESOLVER_TRACE(event, siteNumber, ...)                                               \
+  do {                                                                                             \
+    if (__builtin_expect(Trace_ClassLevelGet(KARST_RESOLVER_TRACE_CLASS_##event) >=                \
+                             KARST_RESOLVER_TRACE_LEVEL_##event,                                   \
+                         0)) {                                                                     \
+      const uint64_t tracePayload[6] = {__VA_ARGS__};                                              \
+      KARSTResolverTraceEmit(&KARSTResolverTrace##event##Tb,                                       \
+                             KARST_RESOLVER_TRACE_KIND(                                            \
+                                 TRACE_RECORD_EVENT, KARST_RESOLVER_TRACE_ID_##event, siteNumber), \
+                             tracePayload);                                                        \
+    }                                                                                              \
   } while (0)
 
 /* A flag as a payload word: a u8, sign-extended. */

@@ -11,6 +11,7 @@
 #include "host/kernel/heap.h"
 #include "host/kernel/panic.h"
 #include "host/kernel/text.h"
+#include "host/threads/clock.h"
 #include "host/threads/worlds.h"
 #include "platform/tolm.h"
 #include "sim/access/access.h"
@@ -205,6 +206,14 @@ extern "C" uint64_t zel_GetTimerCycles(void) {
 extern "C" uint64_t zel_TimerTCToNS(uint64_t cycles) {
   PlatformCall call(Call::zel_TimerTCToNS, Argument::number(cycles));
   return call.returns(cycles);
+}
+
+/* Virtual time has no ticks: every reading is exact. */
+uint64_t host::tickNanoseconds() {
+  return zel_TimerTCToNS(zel_GetTimerCycles());
+}
+uint64_t host::tickInterval() {
+  return 0;
 }
 
 extern "C" void tolmapi_PreemptionEnable(void) {

@@ -10,10 +10,13 @@
 #include <string_view>
 #include <thread>
 
+#include "host/threads/clock.h"
+
 using namespace testing;
 
 namespace {
 std::atomic<uint64_t> clockNanoseconds{0};
+std::atomic<uint64_t> tick{1}; /* ns */
 }  // namespace
 
 extern "C" uint64_t zel_GetTimerCycles(void) {
@@ -21,6 +24,12 @@ extern "C" uint64_t zel_GetTimerCycles(void) {
 }
 extern "C" uint64_t zel_TimerTCToNS(uint64_t cycles) {
   return cycles / 2;
+}
+uint64_t host::tickNanoseconds() {
+  return clockNanoseconds / tick * tick;
+}
+uint64_t host::tickInterval() {
+  return tick;
 }
 
 namespace {
@@ -176,6 +185,7 @@ TEST_F(Tracing, LevelsAreSetClassByClassAndNoticeIdsFitTheirField) {
 class Buckets : public Tracing, public WithParamInterface<const char *> {
  protected:
   Buckets() { start(4, 4); }
+  ~Buckets() override { tick = 1; }
 
   /* A full bucket at the clock's zero; the other kind keeps another rate. */
   void start(uint64_t burst, uint64_t perSecond) {
@@ -229,6 +239,21 @@ TEST_P(Buckets, GrantOneTokenAnIntervalUpToTheBurst) {
   EXPECT_EQ(use(), 0);
   clockNanoseconds += 1000 * kSecond;
   EXPECT_EQ(use(5), -1 - 4);
+}
+
+/* In one second, asked all the time: its rate's tokens, whether a tick's fill the bucket or not. */
+TEST_P(Buckets, LoseNoTokenBetweenTicks) {
+  tick = 4'000'000;
+  const auto granted = [&](uint64_t burst, uint64_t perSecond) {
+    start(burst, perSecond);
+    use(burst);
+    int count = 0;
+    for (; clockNanoseconds < kSecond; clockNanoseconds += 10'000) count += use() >= 0;
+    return count;
+  };
+  EXPECT_EQ(granted(1, 10'000), 9'999);
+  EXPECT_EQ(granted(8, 2'000), 1'992); /* the second's last tick brings its tokens to the next */
+  EXPECT_EQ(granted(64, 50), 49);
 }
 
 TEST_P(Buckets, KeepToTheirExtremes) {

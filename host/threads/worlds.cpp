@@ -5,6 +5,7 @@
 #include "host/threads/worlds.h"
 
 #include <sched.h>
+#include <sys/rseq.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -296,7 +297,12 @@ extern "C" void tolmapi_PreemptionEnable(void) {
   requireNoSpinlock("enables preemption", "tolmapi_PreemptionEnable");
 }
 
+/* The kernel keeps the number in a place of the thread's own (rseq), unless the C library has not
+ * asked for that; then it is below zero there. */
 extern "C" uint32_t tolmapi_GetPCPUNumPreemptible(void) {
+  const auto *area = static_cast<const char *>(__builtin_thread_pointer()) + __rseq_offset;
+  const uint32_t known = reinterpret_cast<const volatile struct rseq *>(area)->cpu_id;
+  if (static_cast<int32_t>(known) >= 0) return known;
   const int processor = sched_getcpu();
   return processor < 0 ? 0 : static_cast<uint32_t>(processor);
 }

@@ -9,6 +9,8 @@
 #include <atomic>
 #include <limits>
 
+#include "host/threads/clock.h"
+
 namespace host {
 
 namespace {
@@ -18,12 +20,23 @@ constexpr int64_t kSinceEver = std::numeric_limits<int64_t>::min();
 
 constexpr uint64_t kNever = std::numeric_limits<uint64_t>::max();
 
+/* What a bucket's tokens gather by: nothing at all, the clock as of its last tick, or the clock. */
+enum class Pace : uint64_t { Still, Ticks, Clock };
+
 /* A rate made ready for counting. */
 struct Gathering {
   int64_t interval; /* ns between two tokens */
   int64_t burst;
-  bool refills;
+  Pace pace;
 };
+
+/* A tick's tokens come all at once. A bucket that has room for them loses none and gives out as many
+ * as by the clock, a tick later at most; and refusing, which is what a dry bucket does at each event
+ * of a flood, costs little. */
+Pace paceOf(const TokenRate &rate, uint64_t interval, uint64_t burst) {
+  if (rate.perSecond == 0) return Pace::Still;
+  return interval * burst >= tickInterval() ? Pace::Ticks : Pace::Clock;
+}
 
 Gathering gatheringOf(const TokenRate &rate) {
   constexpr uint64_t kSecond = 1'000'000'000;
@@ -32,13 +45,15 @@ Gathering gatheringOf(const TokenRate &rate) {
   /* Keeps the moments of full buckets, and sums with them, inside the number's range. */
   const uint64_t mostTokens =
       static_cast<uint64_t>(std::numeric_limits<int64_t>::max() / 4) / interval;
-  return {static_cast<int64_t>(interval), static_cast<int64_t>(std::min(rate.burst, mostTokens)),
-          rate.perSecond != 0};
+  const uint64_t burst = std::min(rate.burst, mostTokens);
+  return {static_cast<int64_t>(interval), static_cast<int64_t>(burst),
+          paceOf(rate, interval, burst)};
 }
 
 /* The time that refills go by. For a bucket without refills it stands still. */
-int64_t timeOf(const Gathering &gathering) {
-  if (!gathering.refills) return 0;
+inline int64_t timeOf(const Gathering &gathering) {
+  if (gathering.pace == Pace::Ticks) return static_cast<int64_t>(tickNanoseconds());
+  if (gathering.pace == Pace::Still) return 0;
   return static_cast<int64_t>(zel_TimerTCToNS(zel_GetTimerCycles()));
 }
 
@@ -47,11 +62,14 @@ int64_t cappedMoment(int64_t moment, const Gathering &gathering, int64_t now) {
 }
 
 uint64_t tokensSince(int64_t moment, const Gathering &gathering, int64_t now) {
-  /* Another thread, with a later clock, may have moved the moment beyond our now. */
-  return moment >= now ? 0 : static_cast<uint64_t>((now - moment) / gathering.interval);
+  /* Negative when another thread, with a later clock, has moved the moment beyond our now. */
+  const int64_t gathered = now - moment;
+  return gathered < gathering.interval ? 0 : static_cast<uint64_t>(gathered / gathering.interval);
 }
 
-bool useTokens(uint64_t &word, const Gathering &gathering, uint64_t tokens, uint64_t *left) {
+/* In line for either kind of bucket: a refusal is to cost little beside its clock. */
+[[gnu::always_inline]] inline bool useTokens(uint64_t &word, const Gathering &gathering,
+                                             uint64_t tokens, uint64_t *left) {
   const int64_t now = timeOf(gathering);
   const std::atomic_ref<uint64_t> state(word);
   uint64_t seen = state.load(std::memory_order_relaxed);
@@ -76,7 +94,7 @@ uint64_t timeToToken(uint64_t &word, const Gathering &gathering) {
   const auto stored = static_cast<int64_t>(std::atomic_ref(word).load(std::memory_order_relaxed));
   const int64_t moment = cappedMoment(stored, gathering, now);
   if (gathering.burst > 0 && tokensSince(moment, gathering, now) > 0) return 0;
-  if (gathering.burst == 0 || !gathering.refills) return kNever;
+  if (gathering.burst == 0 || gathering.pace == Pace::Still) return kNever;
   return static_cast<uint64_t>(moment + gathering.interval - now);
 }
 
@@ -84,11 +102,11 @@ uint64_t timeToToken(uint64_t &word, const Gathering &gathering) {
 Gathering miniGathering{};
 
 /* The words of a full bucket: its state, then its rate. */
-enum FullBucketWord { kState, kInterval, kBurst, kRefills };
+enum FullBucketWord { kState, kInterval, kBurst, kPace };
 
 Gathering gatheringOf(const TokenBucket &bucket) {
   return {std::max<int64_t>(static_cast<int64_t>(bucket.opaque[kInterval]), 1),
-          static_cast<int64_t>(bucket.opaque[kBurst]), bucket.opaque[kRefills] != 0};
+          static_cast<int64_t>(bucket.opaque[kBurst]), Pace{bucket.opaque[kPace]}};
 }
 
 }  // namespace
@@ -103,7 +121,7 @@ void initTokenBucket(TokenBucket &bucket, const TokenRate &rate) {
   bucket.opaque[kState] = static_cast<uint64_t>(kSinceEver);
   bucket.opaque[kInterval] = static_cast<uint64_t>(gathering.interval);
   bucket.opaque[kBurst] = static_cast<uint64_t>(gathering.burst);
-  bucket.opaque[kRefills] = gathering.refills ? 1 : 0;
+  bucket.opaque[kPace] = static_cast<uint64_t>(gathering.pace);
 }
 
 uint64_t timeToToken(TokenBucket &bucket) {

@@ -40,8 +40,10 @@ constexpr uint32_t kGlobalThrottledId = 0x3fff;
 constexpr uint64_t kSequenceMask = (1u << 29) - 1;
 constexpr uint64_t kPhaseBit = 1;
 
+/* Read at every trace statement of a module, so without a way round to them. */
+constinit std::array<std::atomic<int32_t>, kClasses> levels{};
+
 struct Tracing {
-  std::array<std::atomic<int32_t>, kClasses> levels{};
   std::atomic<uint64_t> notifications{0};
   std::mutex wallClockMutex;
   std::array<WallClockEntry, kMostWallClockEntries> wallClock{};
@@ -136,7 +138,7 @@ void configureTracing(const TraceSettings &settings) {
   auto &stream = traceStreamTables[kModulesStream];
   stream = newStream(settings, static_cast<TraceStream *>(stream));
   setMiniBucketRate({settings.perEventBurst, settings.perEventPerSecond});
-  for (auto &level : all.levels) level = settings.classLevel;
+  for (auto &level : levels) level = settings.classLevel;
   all.notifications = 0;
   {
     const std::lock_guard guard(all.wallClockMutex);
@@ -150,7 +152,7 @@ void setTraceClassLevel(uint32_t traceClass, int32_t level) {
                kClasses - 1);
     return;
   }
-  tracing().levels[traceClass].store(level, std::memory_order_relaxed);
+  levels[traceClass].store(level, std::memory_order_relaxed);
 }
 
 void setTraceThrottling(bool on) {
@@ -199,7 +201,7 @@ extern "C" {
 
 int32_t Trace_ClassLevelGet(uint32_t traceClass) {
   if (traceClass >= kClasses) return kNoSuchClass;
-  return tracing().levels[traceClass].load(std::memory_order_relaxed);
+  return levels[traceClass].load(std::memory_order_relaxed);
 }
 
 uint64_t TokenBucket_TimeToGetTokens(void *bucket) {

@@ -11,7 +11,8 @@
 namespace host {
 
 /* A bucket is full at first and gains its rate's tokens, each after a whole number of nanoseconds;
- * at a rate of 0 what is taken never comes back. */
+ * at a rate of 0 what is taken never comes back. A bucket that takes longer to fill than the kernel's
+ * tick (some milliseconds) gets a tick's tokens together, at its end. */
 struct TraceSettings {
   uint32_t slots = 16384; /* of the ring, a power of two */
   bool enabled = true;

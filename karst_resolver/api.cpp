@@ -150,14 +150,17 @@ EXPORTED zel_Status KARSTResolver_GetNodeLocators(KARSTResolverInstance *instanc
     return ZEL_NOT_FOUND;
   }
   const KARSTResolverNodeLocators *own = &instance->locators;
-  nodeLocators->nodeUUID = own->nodeUUID;
-  nodeLocators->majorVersion = own->majorVersion;
-  nodeLocators->minorVersion = own->minorVersion;
+  /* Copied in line and in large pieces, for clients do this most of all: first what lies together at
+   * the start, the UUID and both versions; at last, as most nodes have them, all slots at once. */
+  __builtin_memcpy(nodeLocators, own, offsetof(KARSTResolverNodeLocators, reserved));
   nodeLocators->trafficType = own->trafficType;
   uint16_t count = nodeLocators->capacity < own->count ? nodeLocators->capacity : own->count;
   nodeLocators->count = count;
-  __builtin_memcpy((uint8_t *)nodeLocators + offsetof(KARSTResolverNodeLocators, locators),
-                   own->locators, count * sizeof(KARSTResolverNodeLocator));
+  if (count == KARST_RESOLVER_MAX_LOCATORS) {
+    __builtin_memcpy(nodeLocators->locators, own->locators, sizeof own->locators);
+  } else {
+    for (uint16_t i = 0; i < count; i++) nodeLocators->locators[i] = own->locators[i];
+  }
   KARSTResolverUnlockInstance(instance);
   return ZEL_OK;
 }

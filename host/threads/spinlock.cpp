@@ -7,15 +7,14 @@
 #include <sched.h>
 #include <unistd.h>
 
-#include <algorithm>
-
 #include "host/kernel/panic.h"
 #include "host/threads/thread_name.h"
 #include "platform/tolm.h"
 
 namespace host {
 
-[[gnu::tls_model("initial-exec")]] constinit thread_local HeldLocks heldLocks{};
+[[gnu::tls_model("initial-exec"),
+  gnu::visibility("hidden")]] constinit thread_local HeldLocks heldLocks{};
 
 namespace {
 
@@ -23,8 +22,8 @@ namespace {
  * lost its processor needs ours. */
 constexpr int kSpinsBeforeYield = 100;
 
-constexpr int kMarkTimeBits = 48;
-constexpr uint64_t kMarkTimeMask = (uint64_t{1} << kMarkTimeBits) - 1;
+/* Long enough for a waiter that runs to see that the lock is free and to take it. */
+constexpr int kSpinsForOthers = 64;
 
 std::atomic<uint64_t> lockSliceMicroseconds{2'000};
 
@@ -32,30 +31,20 @@ uint64_t microsecondsNow() {
   return zel_TimerTCToNS(zel_GetTimerCycles()) / 1'000;
 }
 
+bool holds(const HeldLocks &mine, const Spinlock &wanted) {
+  const Spinlock *lock = mine.last;
+  while (lock != nullptr && lock != &wanted) lock = lock->outer;
+  return lock != nullptr;
+}
+
 [[noreturn, gnu::cold, gnu::noinline]] void panicOnOrder(const Spinlock &lock) {
   const HeldLocks &mine = heldLocks;
-  const auto end = mine.locks + mine.count;
-  if (std::find(mine.locks, end, &lock) != end) {
+  if (holds(mine, lock)) {
     panic("spinlock \"%s\" (rank %u) is taken again by the thread that holds \"%s\" already",
           lock.name.text, lock.rank, lock.name.text);
   }
-  const Spinlock &last = *mine.locks[mine.count - 1];
-  if (mine.count == kMostLocksHeld) {
-    panic("spinlock \"%s\" is taken by a thread that holds %zu locks already, the last \"%s\"",
-          lock.name.text, kMostLocksHeld, last.name.text);
-  }
   panic("spinlock \"%s\" (rank %u) is taken while \"%s\" (rank %u) is held: ranks must rise",
-        lock.name.text, lock.rank, last.name.text, last.rank);
-}
-
-/* Tells the holder since when, at the latest, it has held the lock. The number of the hold is read
- * before the clock and goes with the time: a mark that comes too late, when the lock has changed
- * hands, names a hold that is over and counts for nobody. */
-void markWait(Spinlock &lock) {
-  const uint64_t hold = lock.hold.load(std::memory_order_relaxed);
-  if (lock.waitMark.load(std::memory_order_relaxed) >> kMarkTimeBits == hold) return;
-  const uint64_t mark = (hold << kMarkTimeBits) | (microsecondsNow() & kMarkTimeMask);
-  lock.waitMark.store(mark, std::memory_order_relaxed);
+        lock.name.text, lock.rank, mine.last->name.text, mine.last->rank);
 }
 
 bool tryTake(Spinlock &lock, uint32_t thread) {
@@ -64,33 +53,55 @@ bool tryTake(Spinlock &lock, uint32_t thread) {
                                              std::memory_order_relaxed);
 }
 
-/* What its new holder notes about a lock. */
-void noteTaken(Spinlock &lock, HeldLocks &mine) {
-  const auto hold = static_cast<uint16_t>(lock.hold.load(std::memory_order_relaxed) + 1);
-  lock.hold.store(hold, std::memory_order_relaxed);
-  mine.locks[mine.count++] = &lock;
+/* What its new holder notes about a lock. It is mostly taken under the same one, or none; a store beside
+ * `holder`, which the next exchange would wait for, costs more than the question. */
+void noteTaken(Spinlock &lock, HeldLocks &mine, Spinlock *outer) {
+  if (lock.outer != outer) lock.outer = outer;
+  std::atomic_signal_fence(std::memory_order_release); /* a report walks the list */
+  mine.last = &lock;
+}
+
+/* A thread that takes a lock over and over has it in its processor's cache, and would always be
+ * faster than one that waits elsewhere. So who comes while somebody spins for the lock gives them the
+ * time to take it; but not for long, because they may have lost their processor. */
+void letOthersGoFirst(Spinlock &lock) {
+  for (int spins = 0; lock.wanted.load(std::memory_order_relaxed); ++spins) {
+    if (lock.holder.load(std::memory_order_relaxed) != 0) return;
+    if (spins == kSpinsForOthers) return lock.wanted.store(false, std::memory_order_relaxed);
+    _mm_pause();
+  }
+}
+
+void spinFor(Spinlock &lock, uint32_t thread) {
+  for (int spins = 1;; ++spins) {
+    if (lock.holder.load(std::memory_order_relaxed) == 0 && tryTake(lock, thread)) return;
+    if (spins % kSpinsBeforeYield == 0) {
+      sched_yield();
+      continue;
+    }
+    if (!lock.wanted.load(std::memory_order_relaxed)) {
+      lock.wanted.store(true, std::memory_order_relaxed);
+    }
+    _mm_pause();
+  }
 }
 
 /* Locking and unlocking are leaf functions as long as nothing is unusual; what is goes on in
- * functions like this one, which finish the job themselves. This one: a lock that is held, or a
- * thread's first. */
+ * functions like this one, which finish the job themselves. This one: a lock that is held or that
+ * others wait for, or a thread's first. */
 [[gnu::cold, gnu::noinline]] void waitAndTake(Spinlock &lock) {
   HeldLocks &mine = heldLocks;
   if (mine.thread == 0) mine.thread = static_cast<uint32_t>(gettid());
   mine.waitingFor = &lock;
-  lock.waiters.fetch_add(1, std::memory_order_relaxed);
-  for (int spins = 0;; ++spins) {
-    if (lock.holder.load(std::memory_order_relaxed) == 0 && tryTake(lock, mine.thread)) break;
-    if (spins < kSpinsBeforeYield) {
-      _mm_pause();
-      continue;
-    }
-    markWait(lock);
-    sched_yield();
+  letOthersGoFirst(lock);
+  if (!tryTake(lock, mine.thread)) {
+    lock.waiters.fetch_add(1, std::memory_order_relaxed);
+    spinFor(lock, mine.thread);
+    lock.waiters.fetch_sub(1, std::memory_order_relaxed);
+    lock.wanted.store(false, std::memory_order_relaxed); /* who still spins for it says so again */
   }
-  lock.waiters.fetch_sub(1, std::memory_order_relaxed);
   mine.waitingFor = nullptr;
-  noteTaken(lock, mine);
+  noteTaken(lock, mine, mine.last);
 }
 
 /* The last touch of a lock: whoever sees it free may release its memory at once. */
@@ -108,33 +119,33 @@ void giveBack(Spinlock &lock) {
         describeThread(static_cast<pid_t>(holder)).c_str());
 }
 
-/* Gives back a lock that is not the last one taken, if it was taken at all. */
-[[gnu::cold, gnu::noinline]] void giveBackOutOfOrder(Spinlock &lock) {
+/* Gives back a lock whose hold was timed, or that is not the last one taken, if it was taken at
+ * all. */
+[[gnu::cold, gnu::noinline]] void giveBackUnusual(Spinlock &lock) {
   HeldLocks &mine = heldLocks;
-  const auto end = mine.locks + mine.count;
-  const auto found = std::find(mine.locks, end, &lock);
-  if (found == end) panicOnForeignUnlock(lock);
-  std::copy(found + 1, end, found); /* ranks go on rising */
-  --mine.count;
+  if (!holds(mine, lock)) panicOnForeignUnlock(lock);
+  Spinlock **place = &mine.last;
+  while (*place != &lock) place = &(*place)->outer;
+  *place = lock.outer;
+  lock.timed = false;
   giveBack(lock);
 }
 
 /* Has the calling thread, which holds the lock, been waited for longer than the slice? */
-bool isOverdue(const Spinlock &lock) {
+bool isOverdue(Spinlock &lock) {
   if (lock.waiters.load(std::memory_order_relaxed) == 0) return false;
-  const uint64_t mark = lock.waitMark.load(std::memory_order_relaxed);
-  if (mark >> kMarkTimeBits != lock.hold.load(std::memory_order_relaxed)) return false;
-  const uint64_t held = (microsecondsNow() - mark) & kMarkTimeMask;
-  return held > lockSliceMicroseconds.load(std::memory_order_relaxed);
+  const uint64_t now = microsecondsNow();
+  if (!lock.timed) lock.waitedSince = now;
+  lock.timed = true;
+  return now - lock.waitedSince > lockSliceMicroseconds.load(std::memory_order_relaxed);
 }
 
 }  // namespace
 
 void requireNoSpinlock(const char *doing, const char *what) {
-  if (heldLocks.count == 0) return;
-  const Spinlock &last = *heldLocks.locks[heldLocks.count - 1];
+  if (heldLocks.last == nullptr) return;
   panic("%s %s (%s) while it holds spinlock \"%s\"", describeThread(gettid()).c_str(), doing, what,
-        last.name.text);
+        heldLocks.last->name.text);
 }
 
 void requireUnused(const Spinlock &lock, const char *doing) {
@@ -159,39 +170,37 @@ using namespace host;
 extern "C" void zel_SpinlockLock(zel_SpinlockHandle handle) {
   Spinlock &lock = lockOf(handle);
   HeldLocks &mine = heldLocks;
-  const uint32_t count = mine.count;
-  if (count != 0 && (lock.rank <= mine.locks[count - 1]->rank || count == kMostLocksHeld)) {
-    panicOnOrder(lock);
-  }
-  if (mine.thread == 0 || !tryTake(lock, mine.thread)) {
+  Spinlock *const outer = mine.last;
+  if (outer != nullptr && lock.rank <= outer->rank) panicOnOrder(lock);
+  if (lock.wanted.load(std::memory_order_relaxed) || mine.thread == 0 ||
+      !tryTake(lock, mine.thread)) {
     waitAndTake(lock);
   } else {
-    noteTaken(lock, mine);
+    noteTaken(lock, mine, outer);
   }
 }
 
 extern "C" void zel_SpinlockUnlock(zel_SpinlockHandle handle) {
   Spinlock &lock = lockOf(handle);
   HeldLocks &mine = heldLocks;
-  const uint32_t count = mine.count;
-  if (count == 0 || mine.locks[count - 1] != &lock) {
-    giveBackOutOfOrder(lock);
+  if (mine.last != &lock || lock.timed) {
+    giveBackUnusual(lock);
   } else {
-    mine.count = count - 1;
+    mine.last = lock.outer;
     giveBack(lock);
   }
 }
 
-/* A hold is timed from the moment when its first waiter gave up spinning, because taking a free
- * lock reads no clock. So an answer may come up to a slice late, and is never wrong. */
+/* A hold is timed from the first question at which somebody waits, because taking a free lock reads
+ * no clock. So an answer may come late, by up to a slice, and is never wrong. */
 extern "C" bool tolmapi_PreemptionIsPending(void) {
   HeldLocks &mine = heldLocks;
   if (mine.preemptionAnswered) {
     mine.preemptionAnswered = false;
     return false;
   }
-  for (uint32_t i = 0; i < mine.count; ++i) {
-    if (isOverdue(*mine.locks[i])) {
+  for (Spinlock *lock = mine.last; lock != nullptr; lock = lock->outer) {
+    if (isOverdue(*lock)) {
       mine.preemptionAnswered = true;
       return true;
     }

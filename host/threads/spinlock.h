@@ -19,15 +19,16 @@ namespace host {
 
 struct LockDomain;
 
-/* A lock lives in its owner's heap and its handle is its address. The fields of the uncontended
- * path come first, on one cache line. */
+/* A lock lives in its owner's heap and its handle is its address. What taking and giving back a free
+ * lock touches comes first and is 16 bytes, as heap blocks are aligned: never two cache lines. */
 struct Spinlock {
   std::atomic<uint32_t> holder{0}; /* thread that holds it; 0: free */
   uint16_t rank = 0;
-  std::atomic<uint16_t> hold{0}; /* counts the times that it was taken; written by the holder */
+  std::atomic<bool> wanted{false}; /* somebody spins for it: who comes now lets them go first */
+  bool timed = false;              /* waitedSince is set; the holder's own, as are the next two */
+  Spinlock *outer = nullptr;       /* the lock that its holder took before it */
+  uint64_t waitedSince = 0;        /* us; when the holder first learned that somebody waits */
   std::atomic<uint32_t> waiters{0};
-  /* A hold (upper 16 bits) and a time (us) by which it had begun. */
-  std::atomic<uint64_t> waitMark{0};
   zel_Name name{};
   zel_HeapID heap = ZEL_NO_HEAP;
   LockDomain *domain = nullptr;
@@ -39,19 +40,18 @@ inline Spinlock &lockOf(zel_SpinlockHandle handle) {
   return *reinterpret_cast<Spinlock *>(handle);
 }
 
-constexpr size_t kMostLocksHeld = 16;
-
-/* What the calling thread holds. Ranks rise along the array, so that its last lock alone decides
+/* What the calling thread holds. Ranks fall along the list, so that its first lock alone decides
  * whether another one may be taken. */
 struct HeldLocks {
-  uint32_t thread; /* the system's number of this thread; 0 until its first lock */
-  uint32_t count;
+  uint32_t thread;            /* the system's number of this thread; 0 until its first lock */
   bool preemptionAnswered;    /* the last answer to "is preemption pending?" was yes */
+  Spinlock *last;             /* of those held, the one taken last; the others by `outer` */
   const Spinlock *waitingFor; /* the lock that the thread spins for at the moment */
-  Spinlock *locks[kMostLocksHeld];
 };
-/* Reached without a call, so that taking a free lock needs no stack. */
-[[gnu::tls_model("initial-exec")]] extern constinit thread_local HeldLocks heldLocks;
+/* Reached without a call, so that taking a free lock needs no stack, and, being the program's own,
+ * without a look at where it lies. */
+[[gnu::tls_model("initial-exec"),
+  gnu::visibility("hidden")]] extern constinit thread_local HeldLocks heldLocks;
 
 /* Panics, naming the lock, when the calling thread holds one: `doing` and `what` say what it must
  * not do meanwhile ("waits", "for deliveries"). */

@@ -18,13 +18,14 @@ namespace host {
 namespace {
 
 constexpr int kMostFrames = 48;
+constexpr uint32_t kMostLocks = 16; /* nobody nests more */
 
 /* The default action of this signal is to ignore it, so a thread that is interrupted late, when the
  * handler is gone, is not harmed. */
 constexpr int kReportSignal = SIGURG;
 
 struct ThreadReport {
-  zel_Name held[kMostLocksHeld];
+  zel_Name held[kMostLocks];
   uint32_t heldCount;
   zel_Name waitingFor; /* empty: for none */
   void *frames[kMostFrames];
@@ -36,8 +37,10 @@ ThreadReport report;
 /* Runs in the thread reported on. Names are copied here and now: the locks that a thread holds or
  * waits for exist, but once it has gone on they may not. */
 void writeReport(int) {
-  report.heldCount = std::min<uint32_t>(heldLocks.count, kMostLocksHeld);
-  for (uint32_t i = 0; i < report.heldCount; ++i) report.held[i] = heldLocks.locks[i]->name;
+  report.heldCount = 0;
+  for (const Spinlock *lock = heldLocks.last; lock != nullptr; lock = lock->outer) {
+    if (report.heldCount < kMostLocks) report.held[report.heldCount++] = lock->name;
+  }
   report.waitingFor = heldLocks.waitingFor != nullptr ? heldLocks.waitingFor->name : zel_Name{};
   report.frameCount = backtrace(report.frames, kMostFrames);
   sem_post(&report.written);

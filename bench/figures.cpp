@@ -5,6 +5,7 @@
 #include <cmath>
 #include <cstdio>
 #include <nlohmann/json.hpp>
+#include <set>
 
 #include "bench/registry.h"
 
@@ -42,13 +43,18 @@ const Figures::Figure *Figures::find(const Subject &subject) const {
   return found == figures_.end() ? nullptr : &found->second;
 }
 
-/* As the subjects were named, each followed by its percentiles. */
+/* Work by work, in the order in which it was first named, each followed by its percentiles. */
 std::vector<std::pair<Subject, Figures::Figure>> Figures::inOrder() const {
   std::vector<std::pair<Subject, Figure>> ordered;
-  for (const Subject &named : registry().subjects) {
+  std::set<std::string> done;
+  for (const Subject &first : registry().subjects) {
+    if (!done.insert(first.work).second) continue;
     for (const std::string suffix : {"", ", p50", ", p99"}) {
-      const Subject subject{named.work + suffix, named.who};
-      if (const Figure *figure = find(subject)) ordered.emplace_back(subject, *figure);
+      for (const Subject &subject : registry().subjects) {
+        if (subject.work != first.work) continue;
+        const Subject named{subject.work + suffix, subject.who};
+        if (const Figure *figure = find(named)) ordered.emplace_back(named, *figure);
+      }
     }
   }
   return ordered;

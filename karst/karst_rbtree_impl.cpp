@@ -19,212 +19,297 @@ namespace {
 enum Side { LEFT = 0, RIGHT = 1 };
 
 Side Opposite(Side side) {
-  return side == LEFT ? RIGHT : LEFT;
+  return (Side)(RIGHT - side);
 }
 
-KARSTRBTreeNode *At(const KARSTRBTree *tree, uint64_t link) {
-  return (KARSTRBTreeNode *)(tree->base + link);
+/* What of a tree stays as it is while nodes are visited and relinked: a copy in two registers, since
+ * the compiler must take any store into a node for one into the tree. Nodes are named by their links
+ * here. */
+struct Links {
+  uint64_t base;
+  uint64_t nil;
+};
+
+Links LinksOf(const KARSTRBTree *tree) {
+  return {tree->base, tree->data->nil};
 }
 
-uint64_t LinkTo(const KARSTRBTree *tree, const void *address) {
-  return (uint64_t)address - tree->base;
+KARSTRBTreeNode *At(Links links, uint64_t link) {
+  return (KARSTRBTreeNode *)(links.base + link);
 }
 
-const KARSTRBTreeKey *KeyOf(const KARSTRBTree *tree, const KARSTRBTreeNode *node) {
-  return (const KARSTRBTreeKey *)(tree->base + node->key);
+KARSTRBTreeNode *NullIfNil(Links links, uint64_t link) {
+  return link == links.nil ? nullptr : At(links, link);
 }
 
-KARSTRBTreeNode *Nil(const KARSTRBTree *tree) {
-  return At(tree, tree->data->nil);
-}
-KARSTRBTreeNode *Root(const KARSTRBTree *tree) {
-  return At(tree, tree->data->root);
-}
-KARSTRBTreeNode *Parent(const KARSTRBTree *tree, const KARSTRBTreeNode *node) {
-  return At(tree, node->parent);
+uint64_t LinkTo(Links links, const void *address) {
+  return (uint64_t)address - links.base;
 }
 
-KARSTRBTreeNode *Child(const KARSTRBTree *tree, const KARSTRBTreeNode *node, Side side) {
-  return At(tree, side == LEFT ? node->left : node->right);
+const KARSTRBTreeKey *KeyOf(Links links, uint64_t link) {
+  return (const KARSTRBTreeKey *)(links.base + At(links, link)->key);
 }
 
-void SetChild(const KARSTRBTree *tree, KARSTRBTreeNode *node, Side side,
-              const KARSTRBTreeNode *child) {
-  (side == LEFT ? node->left : node->right) = LinkTo(tree, child);
+uint64_t Parent(Links links, uint64_t link) {
+  return At(links, link)->parent;
 }
 
-void SetParent(const KARSTRBTree *tree, KARSTRBTreeNode *node, const KARSTRBTreeNode *parent) {
-  node->parent = LinkTo(tree, parent);
+void SetParent(Links links, uint64_t link, uint64_t parent) {
+  At(links, link)->parent = parent;
 }
 
-bool IsRed(const KARSTRBTreeNode *node) {
-  return (node->word & KARSTRBTREE_NODE_RED) != 0;
-}
-void SetRed(KARSTRBTreeNode *node) {
-  node->word |= KARSTRBTREE_NODE_RED;
-}
-void SetBlack(KARSTRBTreeNode *node) {
-  node->word &= ~KARSTRBTREE_NODE_RED;
-}
-void CopyColour(KARSTRBTreeNode *to, const KARSTRBTreeNode *from) {
-  to->word = (to->word & ~KARSTRBTREE_NODE_RED) | (from->word & KARSTRBTREE_NODE_RED);
+/* `right` lies behind `left`: no branch chooses between them. */
+uint8_t *ChildField(Links links, uint64_t link, Side side) {
+  return (uint8_t *)At(links, link) + offsetof(KARSTRBTreeNode, left) + side * sizeof(uint64_t);
 }
 
-/* Which child of its parent the node is; the node is not the root. */
-Side SideOf(const KARSTRBTree *tree, const KARSTRBTreeNode *node) {
-  return Child(tree, Parent(tree, node), LEFT) == node ? LEFT : RIGHT;
+uint64_t Child(Links links, uint64_t link, Side side) {
+  return KARSTRBTreeWord(ChildField(links, link, side));
 }
 
-/* Lets `replacement` stand where `node` hangs: below its parent, or as the root. Leaves the
+void SetChild(Links links, uint64_t link, Side side, uint64_t child) {
+  __builtin_memcpy(ChildField(links, link, side), &child, sizeof child);
+}
+
+bool IsRed(Links links, uint64_t link) {
+  return (At(links, link)->word & KARSTRBTREE_NODE_RED) != 0;
+}
+void SetRed(Links links, uint64_t link) {
+  At(links, link)->word |= KARSTRBTREE_NODE_RED;
+}
+void SetBlack(Links links, uint64_t link) {
+  At(links, link)->word &= ~KARSTRBTREE_NODE_RED;
+}
+void CopyColour(Links links, uint64_t to, uint64_t from) {
+  uint32_t colour = At(links, from)->word & KARSTRBTREE_NODE_RED;
+  At(links, to)->word = (At(links, to)->word & ~KARSTRBTREE_NODE_RED) | colour;
+}
+
+/* Which child of this parent the node is. */
+Side SideOf(Links links, uint64_t parent, uint64_t link) {
+  return (Side)(At(links, parent)->left != link);
+}
+
+/* Lets `replacement` stand where a node hangs: below this parent of it, or as the root. Leaves the
  * replacement's own links alone. */
-void ReplaceBelowParent(KARSTRBTree *tree, const KARSTRBTreeNode *node,
-                        const KARSTRBTreeNode *replacement) {
-  KARSTRBTreeNode *parent = Parent(tree, node);
-  if (parent == Nil(tree)) {
-    tree->data->root = LinkTo(tree, replacement);
+void ReplaceBelow(Links links, uint64_t *root, uint64_t parent, uint64_t link,
+                  uint64_t replacement) {
+  if (parent == links.nil) {
+    *root = replacement;
   } else {
-    SetChild(tree, parent, SideOf(tree, node), replacement);
+    SetChild(links, parent, SideOf(links, parent, link), replacement);
   }
 }
 
 /* Rotates towards `side`: the child on the other side takes the node's place. */
-void Rotate(KARSTRBTree *tree, KARSTRBTreeNode *node, Side side) {
-  KARSTRBTreeNode *riser = Child(tree, node, Opposite(side));
-  KARSTRBTreeNode *between = Child(tree, riser, side);
-  SetChild(tree, node, Opposite(side), between);
-  if (between != Nil(tree)) SetParent(tree, between, node);
-  ReplaceBelowParent(tree, node, riser);
-  riser->parent = node->parent;
-  SetChild(tree, riser, side, node);
-  SetParent(tree, node, riser);
+void Rotate(Links links, uint64_t *root, uint64_t link, Side side) {
+  uint64_t parent = Parent(links, link);
+  uint64_t riser = Child(links, link, Opposite(side));
+  uint64_t between = Child(links, riser, side);
+  SetChild(links, link, Opposite(side), between);
+  if (between != links.nil) SetParent(links, between, link);
+  ReplaceBelow(links, root, parent, link, riser);
+  SetParent(links, riser, parent);
+  SetChild(links, riser, side, link);
+  SetParent(links, link, riser);
 }
 
-void RbtLeftRotate(KARSTRBTree *tree, KARSTRBTreeNode *node) {
-  Rotate(tree, node, LEFT);
-}
-void RbtRightRotate(KARSTRBTree *tree, KARSTRBTreeNode *node) {
-  Rotate(tree, node, RIGHT);
+void RotateTowards(Links links, uint64_t *root, uint64_t link, Side side) {
+  Rotate(links, root, link, side);
 }
 
-void RotateTowards(KARSTRBTree *tree, KARSTRBTreeNode *node, Side side) {
-  if (side == LEFT) {
-    RbtLeftRotate(tree, node);
-  } else {
-    RbtRightRotate(tree, node);
+/* The last node from this one, which is not the nil, down along one side. */
+inline uint64_t Outermost(Links links, uint64_t link, Side side) {
+  for (;;) {
+    uint64_t next = Child(links, link, side);
+    if (next == links.nil) return link;
+    link = next;
   }
 }
 
-/* The last node from `node` down along one side. */
-KARSTRBTreeNode *Outermost(const KARSTRBTree *tree, KARSTRBTreeNode *node, Side side) {
-  for (KARSTRBTreeNode *next = Child(tree, node, side); next != Nil(tree);
-       next = Child(tree, next, side)) {
-    node = next;
-  }
-  return node;
-}
-
-/* The neighbour in order on one side, or the nil. */
-KARSTRBTreeNode *Neighbour(const KARSTRBTree *tree, const KARSTRBTreeNode *node, Side side) {
-  KARSTRBTreeNode *child = Child(tree, node, side);
-  if (child != Nil(tree)) return Outermost(tree, child, Opposite(side));
-  KARSTRBTreeNode *ancestor = Parent(tree, node);
-  while (ancestor != Nil(tree) && node == Child(tree, ancestor, side)) {
-    node = ancestor;
-    ancestor = Parent(tree, ancestor);
+/* The nearest ancestor of which the node lies on the other side, or the nil. */
+inline uint64_t AncestorTowards(Links links, uint64_t link, Side side) {
+  uint64_t ancestor = Parent(links, link);
+  while (ancestor != links.nil && link == Child(links, ancestor, side)) {
+    link = ancestor;
+    ancestor = Parent(links, ancestor);
   }
   return ancestor;
 }
 
-KARSTRBTreeNode *RbtTreeSuccessor(const KARSTRBTree *tree, const KARSTRBTreeNode *node) {
-  return Neighbour(tree, node, RIGHT);
+/* The neighbour in order on one side, or the nil. */
+uint64_t Neighbour(Links links, uint64_t link, Side side) {
+  uint64_t child = Child(links, link, side);
+  return child == links.nil ? AncestorTowards(links, link, side)
+                            : Outermost(links, child, Opposite(side));
 }
 
-KARSTRBTreeNode *RbtTreePredecessor(const KARSTRBTree *tree, const KARSTRBTreeNode *node) {
-  return Neighbour(tree, node, LEFT);
+uint64_t RbtTreeSuccessor(Links links, uint64_t link) {
+  return Neighbour(links, link, RIGHT);
 }
 
-KARSTRBTreeNode *NullIfNil(const KARSTRBTree *tree, KARSTRBTreeNode *node) {
-  return node == Nil(tree) ? nullptr : node;
+uint64_t RbtTreePredecessor(Links links, uint64_t link) {
+  return Neighbour(links, link, LEFT);
+}
+
+/* The successor as iteration wants it: its address, or null. */
+inline KARSTRBTreeNode *Following(Links links, const KARSTRBTreeNode *node) {
+  if (node->right != links.nil) return At(links, Outermost(links, node->right, LEFT));
+  return NullIfNil(links, AncestorTowards(links, LinkTo(links, node), RIGHT));
 }
 
 /* A red node came to hang below a red parent, perhaps: mend upwards. */
-void InsertFixUp(KARSTRBTree *tree, KARSTRBTreeNode *node) {
-  while (node != Root(tree) && IsRed(Parent(tree, node))) {
-    KARSTRBTreeNode *parent = Parent(tree, node);
-    KARSTRBTreeNode *grandparent = Parent(tree, parent); /* exists: a red parent is not the root */
-    Side side = SideOf(tree, parent);
-    KARSTRBTreeNode *uncle = Child(tree, grandparent, Opposite(side));
-    if (IsRed(uncle)) {
-      SetBlack(parent);
-      SetBlack(uncle);
-      SetRed(grandparent);
-      node = grandparent;
+void InsertFixUp(Links links, uint64_t *root, uint64_t link) {
+  uint64_t parent;
+  while (IsRed(links, parent = Parent(links, link))) { /* the root's is the nil, which is black */
+    uint64_t grandparent = Parent(links, parent);      /* exists: a red parent is not the root */
+    Side side = SideOf(links, grandparent, parent);
+    uint64_t uncle = Child(links, grandparent, Opposite(side));
+    if (IsRed(links, uncle)) {
+      SetBlack(links, parent);
+      SetBlack(links, uncle);
+      SetRed(links, grandparent);
+      link = grandparent;
       continue;
     }
-    if (SideOf(tree, node) != side) { /* inner child: make it the outer one */
-      node = parent;
-      RotateTowards(tree, node, side);
-      parent = Parent(tree, node);
+    if (SideOf(links, parent, link) != side) { /* inner child: make it the outer one */
+      RotateTowards(links, root, parent, side);
+      parent = link;
     }
-    SetBlack(parent);
-    SetRed(grandparent);
-    RotateTowards(tree, grandparent, Opposite(side));
+    SetBlack(links, parent);
+    SetRed(links, grandparent);
+    RotateTowards(links, root, grandparent, Opposite(side));
+    break; /* the parent is black now */
   }
-  SetBlack(Root(tree));
+  SetBlack(links, *root);
 }
 
-/* Every path through `node` lacks one black node: mend upwards. The node may be the nil, whose
+/* Every path through the node lacks one black node: mend upwards. The node may be the nil, whose
  * parent removal has set for this. */
-void RemoveFixUp(KARSTRBTree *tree, KARSTRBTreeNode *node) {
-  while (node != Root(tree) && !IsRed(node)) {
-    KARSTRBTreeNode *parent = Parent(tree, node);
-    Side side = SideOf(tree, node);
-    KARSTRBTreeNode *sibling = Child(tree, parent, Opposite(side));
-    if (IsRed(sibling)) {
-      SetBlack(sibling);
-      SetRed(parent);
-      RotateTowards(tree, parent, side);
-      sibling = Child(tree, parent, Opposite(side));
+void RemoveFixUp(Links links, uint64_t *root, uint64_t link) {
+  while (link != *root && !IsRed(links, link)) {
+    uint64_t parent = Parent(links, link);
+    Side side = SideOf(links, parent, link);
+    uint64_t sibling = Child(links, parent, Opposite(side));
+    if (IsRed(links, sibling)) {
+      SetBlack(links, sibling);
+      SetRed(links, parent);
+      RotateTowards(links, root, parent, side);
+      sibling = Child(links, parent, Opposite(side));
     }
-    KARSTRBTreeNode *nearChild = Child(tree, sibling, side);
-    KARSTRBTreeNode *farChild = Child(tree, sibling, Opposite(side));
-    if (!IsRed(nearChild) && !IsRed(farChild)) {
-      SetRed(sibling);
-      node = parent;
+    uint64_t nearChild = Child(links, sibling, side);
+    uint64_t farChild = Child(links, sibling, Opposite(side));
+    if (!IsRed(links, nearChild) && !IsRed(links, farChild)) {
+      SetRed(links, sibling);
+      link = parent;
       continue;
     }
-    if (!IsRed(farChild)) {
-      SetBlack(nearChild);
-      SetRed(sibling);
-      RotateTowards(tree, sibling, Opposite(side));
-      sibling = Child(tree, parent, Opposite(side));
-      farChild = Child(tree, sibling, Opposite(side));
+    if (!IsRed(links, farChild)) {
+      SetBlack(links, nearChild);
+      SetRed(links, sibling);
+      RotateTowards(links, root, sibling, Opposite(side));
+      farChild = sibling;
+      sibling = nearChild;
     }
-    CopyColour(sibling, parent);
-    SetBlack(parent);
-    SetBlack(farChild);
-    RotateTowards(tree, parent, side);
-    node = Root(tree);
+    CopyColour(links, sibling, parent);
+    SetBlack(links, parent);
+    SetBlack(links, farChild);
+    RotateTowards(links, root, parent, side);
+    link = *root;
   }
-  SetBlack(node);
+  SetBlack(links, link);
+}
+
+/* ---- Descents -------------------------------------------------------------------------------- */
+
+/* A UUID's two words as one number: two instructions compare it. */
+typedef unsigned __int128 Words;
+
+Words WordsOf(const void *uuid) {
+  return (Words)KARSTRBTreeWord(uuid) << 64 | KARSTRBTreeWord((const uint8_t *)uuid + 8);
+}
+
+/* The words of a node's UUID. To them leads a chain of two loads, by the key record, while in
+ * structures that embed node and UUID the one lies at the same distance from the other in all of them.
+ * So that distance is guessed to be the last one's, and `guessed` (distance plus base) is where the
+ * words are read unless the chain ends elsewhere. That is checked by a branch which the processor
+ * foresees, and so it does not wait for the chain before it goes on: value speculation. */
+Words NodeWords(Links links, uint64_t link, uint64_t *guessed) {
+  uint64_t uuid = (uint64_t)KeyOf(links, link)->uuid;
+  uint64_t guess = *guessed + link;
+  asm("" : "+r"(guess)); /* else the compiler, knowing the two equal, would read by the chain */
+  if (__builtin_expect(guess != uuid, 0)) *guessed = uuid - link;
+  return WordsOf((const void *)(*guessed + link));
+}
+
+/* The child on the side of the probe. As likely one as the other: a conditional move, not a branch,
+ * chooses. */
+uint64_t ChildTowards(Links links, uint64_t link, bool less) {
+  uint64_t left = At(links, link)->left;
+  uint64_t right = At(links, link)->right;
+  return __builtin_expect_with_probability(less, 1, 0.5) ? left : right;
+}
+
+uint64_t FindUuid(Links links, uint64_t link, const zel_UUID *uuid) {
+  Words probe = WordsOf(uuid->bytes);
+  uint64_t guessed = links.base;
+  while (link != links.nil) {
+    Words words = NodeWords(links, link, &guessed);
+    if (__builtin_expect(words == probe, 0)) break;
+    link = ChildTowards(links, link, probe < words);
+  }
+  return link;
+}
+
+uint64_t FindAny(Links links, uint64_t link, const KARSTRBTreeKey *probe) {
+  while (link != links.nil) {
+    int order = KARSTRBTreeCompare(probe, KeyOf(links, link));
+    if (order == 0) break;
+    link = ChildTowards(links, link, order < 0);
+  }
+  return link;
+}
+
+/* Where a new key comes to hang: its parent, or the nil in an empty tree, and the side there. Behind
+ * what it equals. */
+uint64_t PlaceForUuid(Links links, uint64_t root, const zel_UUID *uuid, Side *side) {
+  Words key = WordsOf(uuid->bytes);
+  uint64_t guessed = links.base;
+  uint64_t parent = links.nil;
+  bool less = true;
+  for (uint64_t next = root; next != links.nil; next = ChildTowards(links, next, less)) {
+    parent = next;
+    less = key < NodeWords(links, next, &guessed);
+  }
+  *side = (Side)!less;
+  return parent;
+}
+
+uint64_t PlaceForAny(Links links, uint64_t root, const KARSTRBTreeKey *key, Side *side) {
+  uint64_t parent = links.nil;
+  bool less = true;
+  for (uint64_t next = root; next != links.nil; next = ChildTowards(links, next, less)) {
+    parent = next;
+    less = KARSTRBTreeCompare(key, KeyOf(links, next)) < 0;
+  }
+  *side = (Side)!less;
+  return parent;
 }
 
 /* The descent of both bounds: stops at an equal node, or where the probe would hang. *order tells
  * how the probe compares to the node returned. The tree is not empty. */
-KARSTRBTreeNode *Descend(const KARSTRBTree *tree, const KARSTRBTreeKey *probe, int *order) {
-  KARSTRBTreeNode *node = Root(tree);
+uint64_t Descend(Links links, uint64_t link, const KARSTRBTreeKey *probe, int *order) {
   for (;;) {
-    *order = KARSTRBTreeCompare(probe, KeyOf(tree, node));
-    if (*order == 0) return node;
-    KARSTRBTreeNode *child = Child(tree, node, *order < 0 ? LEFT : RIGHT);
-    if (child == Nil(tree)) return node;
-    node = child;
+    *order = KARSTRBTreeCompare(probe, KeyOf(links, link));
+    if (*order == 0) return link;
+    uint64_t child = ChildTowards(links, link, *order < 0);
+    if (child == links.nil) return link;
+    link = child;
   }
 }
 
-bool EqualsProbe(const KARSTRBTree *tree, const KARSTRBTreeKey *probe,
-                 const KARSTRBTreeNode *node) {
-  return node != Nil(tree) && KARSTRBTreeCompare(probe, KeyOf(tree, node)) == 0;
+bool EqualsProbe(Links links, const KARSTRBTreeKey *probe, uint64_t link) {
+  return link != links.nil && KARSTRBTreeCompare(probe, KeyOf(links, link)) == 0;
 }
 
 }  // namespace
@@ -244,7 +329,7 @@ uint8_t KARSTRBTree_CreateTreeData(KARSTRBTree *tree, KARSTRBTreeNode *nil) {
       return 0;
     }
   }
-  uint64_t nilLink = LinkTo(tree, nil);
+  uint64_t nilLink = (uint64_t)nil - tree->base;
   tree->data->nilAllocated = nilAllocated;
   tree->data->count = 0;
   tree->data->root = nilLink;
@@ -287,7 +372,8 @@ void KARSTRBTree_FreeTree(KARSTRBTree *tree) {
   if (tree == nullptr) return;
   if (tree->data != nullptr) {
     KARSTRBTree_Clear(tree);
-    KARSTRBTreeNode *nil = Nil(tree);
+    Links links = LinksOf(tree);
+    KARSTRBTreeNode *nil = At(links, links.nil);
     if (tree->data->nilAllocated && (nil->word & KARSTRBTREE_NODE_ALLOCATED)) {
       tree->free(tree, nil);
     }
@@ -320,27 +406,25 @@ KARSTRBTreeNode *PREF_InsertEx(KARSTRBTree *tree, KARSTRBTreeNode *node, KARSTRB
     node = (KARSTRBTreeNode *)tree->calloc(tree, 1, sizeof(KARSTRBTreeNode));
     if (node == nullptr) return nullptr;
   }
-  uint64_t nilLink = tree->data->nil;
+  Links links = LinksOf(tree);
+  uint64_t link = LinkTo(links, node);
   node->word = (value & KARSTRBTREE_NODE_VALUE) | KARSTRBTREE_NODE_RED |
                (allocated ? KARSTRBTREE_NODE_ALLOCATED : 0);
-  node->parent = nilLink;
-  node->left = nilLink;
-  node->right = nilLink;
-  node->key = key == nullptr ? 0 : LinkTo(tree, key);
+  node->left = links.nil;
+  node->right = links.nil;
+  node->key = key == nullptr ? 0 : LinkTo(links, key);
 
-  if (Root(tree) == Nil(tree)) {
-    tree->data->root = LinkTo(tree, node);
+  Side side = LEFT;
+  uint64_t *root = &tree->data->root;
+  if (*root == links.nil) {
+    node->parent = links.nil;
+    *root = link;
   } else {
-    KARSTRBTreeNode *parent = Nil(tree);
-    Side side = LEFT;
-    for (KARSTRBTreeNode *next = Root(tree); next != Nil(tree); next = Child(tree, next, side)) {
-      parent = next;
-      side = KARSTRBTreeCompare(key, KeyOf(tree, next)) < 0 ? LEFT : RIGHT; /* equal: behind it */
-    }
-    SetParent(tree, node, parent);
-    SetChild(tree, parent, side, node);
+    node->parent = key->kind == KARSTRBTREE_KEY_UUID ? PlaceForUuid(links, *root, key->uuid, &side)
+                                                     : PlaceForAny(links, *root, key, &side);
+    SetChild(links, node->parent, side, link);
   }
-  InsertFixUp(tree, node);
+  InsertFixUp(links, root, link);
   tree->data->count += 1;
   return node;
 }
@@ -361,52 +445,55 @@ uint32_t KARSTRBTree_GetSize(const KARSTRBTree *tree) {
 }
 
 KARSTRBTreeNode *KARSTRBTree_Find(const KARSTRBTree *tree, const KARSTRBTreeKey *probe) {
-  KARSTRBTreeNode *nil = Nil(tree);
-  KARSTRBTreeNode *node = Root(tree);
-  while (node != nil) {
-    int order = KARSTRBTreeCompare(probe, KeyOf(tree, node));
-    if (order == 0) return node;
-    node = Child(tree, node, order < 0 ? LEFT : RIGHT);
-  }
-  return nullptr;
+  Links links = LinksOf(tree);
+  uint64_t root = tree->data->root;
+  if (root == links.nil) return nullptr; /* whatever the probe is */
+  return NullIfNil(links, probe->kind == KARSTRBTREE_KEY_UUID ? FindUuid(links, root, probe->uuid)
+                                                              : FindAny(links, root, probe));
 }
 
 KARSTRBTreeNode *KARSTRBTree_LowerBound(const KARSTRBTree *tree, const KARSTRBTreeKey *probe) {
   if (tree->data->count == 0) return nullptr;
+  Links links = LinksOf(tree);
   int order;
-  KARSTRBTreeNode *node = Descend(tree, probe, &order);
-  if (order < 0) return node;
-  if (order > 0) return NullIfNil(tree, RbtTreeSuccessor(tree, node));
-  for (KARSTRBTreeNode *before = RbtTreePredecessor(tree, node); EqualsProbe(tree, probe, before);
-       before = RbtTreePredecessor(tree, before)) {
-    node = before;
+  uint64_t link = Descend(links, tree->data->root, probe, &order);
+  if (order > 0) return NullIfNil(links, RbtTreeSuccessor(links, link));
+  if (order < 0) return At(links, link);
+  for (uint64_t before = RbtTreePredecessor(links, link); EqualsProbe(links, probe, before);
+       before = RbtTreePredecessor(links, before)) {
+    link = before;
   }
-  return node;
+  return At(links, link);
 }
 
 KARSTRBTreeNode *KARSTRBTree_UpperBound(const KARSTRBTree *tree, const KARSTRBTreeKey *probe) {
   if (tree->data->count == 0) return nullptr;
+  Links links = LinksOf(tree);
   int order;
-  KARSTRBTreeNode *node = Descend(tree, probe, &order);
-  if (order < 0) return node;
-  KARSTRBTreeNode *after = RbtTreeSuccessor(tree, node);
-  while (order == 0 && EqualsProbe(tree, probe, after)) after = RbtTreeSuccessor(tree, after);
-  return NullIfNil(tree, after);
+  uint64_t link = Descend(links, tree->data->root, probe, &order);
+  if (order < 0) return At(links, link);
+  uint64_t after = RbtTreeSuccessor(links, link);
+  while (order == 0 && EqualsProbe(links, probe, after)) after = RbtTreeSuccessor(links, after);
+  return NullIfNil(links, after);
 }
 
 KARSTRBTreeNode *KARSTRBTree_First(const KARSTRBTree *tree) {
   if (tree->data->count == 0) return nullptr;
-  return Outermost(tree, Root(tree), LEFT);
+  Links links = LinksOf(tree);
+  return At(links, Outermost(links, tree->data->root, LEFT));
 }
 
 KARSTRBTreeNode *KARSTRBTree_Next(const KARSTRBTree *tree, const KARSTRBTreeNode *node) {
-  return NullIfNil(tree, RbtTreeSuccessor(tree, node));
+  /* With links that are addresses, as the module's are, no step waits for an addition. */
+  if (tree->base == 0) return Following({0, tree->data->nil}, node);
+  return Following(LinksOf(tree), node);
 }
 
 KARSTRBTreeNode *KARSTRBTree_Prev(const KARSTRBTree *tree, const KARSTRBTreeNode *node) {
-  if (node != nullptr) return NullIfNil(tree, RbtTreePredecessor(tree, node));
+  Links links = LinksOf(tree);
+  if (node != nullptr) return NullIfNil(links, RbtTreePredecessor(links, LinkTo(links, node)));
   if (tree->data->count == 0) return nullptr;
-  return Outermost(tree, Root(tree), RIGHT);
+  return At(links, Outermost(links, tree->data->root, RIGHT));
 }
 
 /* ---- Removal --------------------------------------------------------------------------------- */
@@ -421,25 +508,27 @@ void KARSTRBTree_Remove(KARSTRBTree *tree, KARSTRBTreeNode *node) {
 
   /* `leaver` gives up its position: the node itself, or its successor, which has no left child and
    * then takes the node's place as a whole. */
-  KARSTRBTreeNode *nil = Nil(tree);
-  KARSTRBTreeNode *leaver = node;
-  if (Child(tree, node, LEFT) != nil && Child(tree, node, RIGHT) != nil) {
-    leaver = RbtTreeSuccessor(tree, node);
-  }
-  KARSTRBTreeNode *orphan = Child(tree, leaver, LEFT);
-  if (orphan == nil) orphan = Child(tree, leaver, RIGHT);
-  orphan->parent = leaver->parent; /* the nil's too: the fix-up climbs from it */
-  ReplaceBelowParent(tree, leaver, orphan);
-  if (!IsRed(leaver)) RemoveFixUp(tree, orphan);
+  Links links = LinksOf(tree);
+  uint64_t *root = &tree->data->root;
+  uint64_t link = LinkTo(links, node);
+  uint64_t leaver = link;
+  if (node->left != links.nil && node->right != links.nil) leaver = RbtTreeSuccessor(links, link);
+  uint64_t orphan = Child(links, leaver, LEFT);
+  if (orphan == links.nil) orphan = Child(links, leaver, RIGHT);
+  uint64_t parent = Parent(links, leaver);
+  SetParent(links, orphan, parent); /* the nil's too: the fix-up climbs from it */
+  ReplaceBelow(links, root, parent, leaver, orphan);
+  if (!IsRed(links, leaver)) RemoveFixUp(links, root, orphan);
 
-  if (leaver != node) { /* into the node's place as the fix-up has left it */
-    leaver->parent = node->parent;
-    leaver->left = node->left;
-    leaver->right = node->right;
-    CopyColour(leaver, node);
-    ReplaceBelowParent(tree, node, leaver);
-    SetParent(tree, Child(tree, node, LEFT), leaver);
-    SetParent(tree, Child(tree, node, RIGHT), leaver);
+  if (leaver != link) { /* into the node's place as the fix-up has left it */
+    KARSTRBTreeNode *successor = At(links, leaver);
+    successor->parent = node->parent;
+    successor->left = node->left;
+    successor->right = node->right;
+    CopyColour(links, leaver, link);
+    ReplaceBelow(links, root, node->parent, link, leaver);
+    SetParent(links, node->left, leaver);
+    SetParent(links, node->right, leaver);
   }
   if (node->word & KARSTRBTREE_NODE_ALLOCATED) tree->free(tree, node);
   tree->data->count -= 1;

@@ -1,0 +1,292 @@
+/* The maps that are compared: ours and its peers, all with the same keys in the same order, each with
+ * the means that it offers for nodes that are not to be allocated.
+ *
+ * Each has: find (null when the key is absent), iterate (a sum over all elements), insertAll and
+ * removeAll (in the order of the keys' numbers), and takeOutAndIn, of one key by its number.
+ */
+#pragma once
+
+#include <absl/container/btree_map.h>
+#include <bsd/sys/tree.h>
+
+#include <boost/intrusive/set.hpp>
+#include <cstdlib>
+#include <map>
+#include <memory>
+#include <vector>
+
+#include "bench/cluster.h"
+#include "karst/karst_rbtree.h"
+
+namespace bench {
+
+/* A key as its two words, by which all maps order. */
+struct Words {
+  uint64_t first, second;
+  bool operator<(const Words &other) const {
+    return first != other.first ? first < other.first : second < other.second;
+  }
+};
+
+inline Words wordsOf(const zel_UUID &uuid) {
+  return {KARSTRBTreeWord(uuid.bytes), KARSTRBTreeWord(uuid.bytes + 8)};
+}
+
+/* The functions of the map, as the loaded module has them. */
+struct MapFunctions {
+  explicit MapFunctions(const Cluster &cluster)
+      : create(cluster.inModule<decltype(KARSTRBTree_AllocTreeEx)>("KARSTRBTree_AllocTreeEx")),
+        end(cluster.inModule<decltype(KARSTRBTree_FreeTree)>("KARSTRBTree_FreeTree")),
+        find(cluster.inModule<decltype(KARSTRBTree_Find)>("KARSTRBTree_Find")),
+        insert(cluster.inModule<decltype(KARSTRBTree_InsertNoAlloc)>("KARSTRBTree_InsertNoAlloc")),
+        remove(cluster.inModule<decltype(KARSTRBTree_Remove)>("KARSTRBTree_Remove")),
+        first(cluster.inModule<decltype(KARSTRBTree_First)>("KARSTRBTree_First")),
+        next(cluster.inModule<decltype(KARSTRBTree_Next)>("KARSTRBTree_Next")) {}
+  decltype(KARSTRBTree_AllocTreeEx) *create;
+  decltype(KARSTRBTree_FreeTree) *end;
+  decltype(KARSTRBTree_Find) *find;
+  decltype(KARSTRBTree_InsertNoAlloc) *insert;
+  decltype(KARSTRBTree_Remove) *remove;
+  decltype(KARSTRBTree_First) *first;
+  decltype(KARSTRBTree_Next) *next;
+};
+
+/* Ours: node, key record and UUID in one element, as the module's cache has them. */
+class OurMap {
+ public:
+  OurMap(const std::vector<zel_UUID> &keys, const MapFunctions &functions)
+      : elements_(keys.size()),
+        functions_(functions),
+        tree_(functions.create(&pool), functions.end) {
+    for (size_t i = 0; i < keys.size(); i++) {
+      elements_[i].uuid = keys[i];
+      elements_[i].key.kind = KARSTRBTREE_KEY_UUID;
+      elements_[i].key.uuid = &elements_[i].uuid;
+      elements_[i].number = static_cast<uint32_t>(i);
+    }
+    insertAll();
+  }
+  const uint32_t *find(const zel_UUID &uuid) const {
+    KARSTRBTreeKey probe;
+    probe.kind = KARSTRBTREE_KEY_UUID;
+    probe.uuid = &uuid;
+    const KARSTRBTreeNode *const node = functions_.find(tree_.get(), &probe);
+    return node == nullptr ? nullptr : &elementOf(node).number;
+  }
+  uint64_t iterate() const {
+    uint64_t sum = 0;
+    for (const KARSTRBTreeNode *node = functions_.first(tree_.get()); node != nullptr;
+         node = functions_.next(tree_.get(), node)) {
+      sum += elementOf(node).number;
+    }
+    return sum;
+  }
+  void insertAll() {
+    for (Element &element : elements_) insert(element);
+  }
+  void removeAll() {
+    for (Element &element : elements_) functions_.remove(tree_.get(), &element.node);
+  }
+  void takeOutAndIn(size_t number) {
+    functions_.remove(tree_.get(), &elements_[number].node);
+    insert(elements_[number]);
+  }
+
+ private:
+  /* As much of a key record as one with a UUID takes. */
+  struct UuidKey {
+    uint32_t kind;
+    const zel_UUID *uuid;
+  };
+  static_assert(offsetof(UuidKey, uuid) == offsetof(KARSTRBTreeKey, uuid));
+  struct Element {
+    zel_UUID uuid;
+    KARSTRBTreeNode node;
+    uint32_t number;
+    UuidKey key;
+  };
+  static const Element &elementOf(const KARSTRBTreeNode *node) {
+    return *reinterpret_cast<const Element *>(reinterpret_cast<const char *>(node) -
+                                              offsetof(Element, node));
+  }
+  void insert(Element &element) { functions_.insert(tree_.get(), &element.node,
+                      reinterpret_cast<KARSTRBTreeKey *>(&element.key), 0); }
+  static constexpr KARSTMemPool pool = {
+      [](void *, uint64_t size) { return std::malloc(size); },
+      [](void *, uint32_t count, uint32_t size) { return std::calloc(count, size); },
+      [](void *, void *block, uint64_t size) { return std::realloc(block, size); },
+      [](void *, void *block) { std::free(block); }, 0};
+
+  std::vector<Element> elements_;
+  const MapFunctions functions_;
+  std::unique_ptr<KARSTRBTree, void (*)(KARSTRBTree *)> tree_; /* goes before its nodes */
+};
+
+/* By node handles: like ours, without allocating. */
+class StdMap {
+ public:
+  explicit StdMap(const std::vector<zel_UUID> &keys) : outside_(keys.size()) {
+    for (const zel_UUID &uuid : keys) {
+      places_.push_back(map_.emplace(wordsOf(uuid), places_.size()).first);
+    }
+  }
+  const uint32_t *find(const zel_UUID &uuid) const {
+    const auto found = map_.find(wordsOf(uuid));
+    return found == map_.end() ? nullptr : &found->second;
+  }
+  uint64_t iterate() const {
+    uint64_t sum = 0;
+    for (const auto &[words, number] : map_) sum += number;
+    return sum;
+  }
+  void insertAll() {
+    for (size_t i = 0; i < outside_.size(); i++) {
+      places_[i] = map_.insert(std::move(outside_[i])).position;
+    }
+  }
+  void removeAll() {
+    for (size_t i = 0; i < outside_.size(); i++) outside_[i] = map_.extract(places_[i]);
+  }
+  void takeOutAndIn(size_t number) {
+    places_[number] = map_.insert(map_.extract(places_[number])).position;
+  }
+
+ private:
+  std::map<Words, uint32_t> map_;
+  std::vector<std::map<Words, uint32_t>::iterator> places_;
+  std::vector<std::map<Words, uint32_t>::node_type> outside_;
+};
+
+class IntrusiveSet {
+ public:
+  explicit IntrusiveSet(const std::vector<zel_UUID> &keys) : elements_(keys.size()) {
+    for (size_t i = 0; i < keys.size(); i++) {
+      elements_[i].words = wordsOf(keys[i]);
+      elements_[i].number = static_cast<uint32_t>(i);
+    }
+    insertAll();
+  }
+  const uint32_t *find(const zel_UUID &uuid) const {
+    const auto found = set_.find(wordsOf(uuid));
+    return found == set_.end() ? nullptr : &found->number;
+  }
+  uint64_t iterate() const {
+    uint64_t sum = 0;
+    for (const Element &element : set_) sum += element.number;
+    return sum;
+  }
+  void insertAll() {
+    for (Element &element : elements_) set_.insert(element);
+  }
+  void removeAll() {
+    for (const Element &element : elements_) set_.erase(set_.iterator_to(element));
+  }
+  void takeOutAndIn(size_t number) {
+    set_.erase(set_.iterator_to(elements_[number]));
+    set_.insert(elements_[number]);
+  }
+
+ private:
+  struct Element : boost::intrusive::set_base_hook<
+                       boost::intrusive::link_mode<boost::intrusive::normal_link>> {
+    Words words;
+    uint32_t number;
+  };
+  struct WordsOf {
+    using type = Words;
+    const Words &operator()(const Element &element) const { return element.words; }
+  };
+
+  std::vector<Element> elements_;
+  boost::intrusive::set<Element, boost::intrusive::key_of_value<WordsOf>> set_;
+};
+
+struct BsdElement {
+  RB_ENTRY(BsdElement) entry;
+  Words words;
+  uint32_t number;
+};
+
+inline int compare(const BsdElement *one, const BsdElement *other) {
+  if (one->words.first != other->words.first) {
+    return one->words.first < other->words.first ? -1 : 1;
+  }
+  return one->words.second < other->words.second ? -1 : one->words.second > other->words.second;
+}
+
+RB_HEAD(BsdTree, BsdElement);
+RB_GENERATE_INTERNAL(BsdTree, BsdElement, entry, compare, [[maybe_unused]] static inline)
+
+class BsdMap {
+ public:
+  explicit BsdMap(const std::vector<zel_UUID> &keys) : elements_(keys.size()) {
+    RB_INIT(&tree_);
+    for (size_t i = 0; i < keys.size(); i++) {
+      elements_[i].words = wordsOf(keys[i]);
+      elements_[i].number = static_cast<uint32_t>(i);
+    }
+    insertAll();
+  }
+  const uint32_t *find(const zel_UUID &uuid) const {
+    BsdElement probe;
+    probe.words = wordsOf(uuid);
+    const BsdElement *const found = RB_FIND(BsdTree, &tree_, &probe);
+    return found == nullptr ? nullptr : &found->number;
+  }
+  uint64_t iterate() const {
+    uint64_t sum = 0;
+    BsdElement *element;
+    RB_FOREACH(element, BsdTree, &tree_) sum += element->number;
+    return sum;
+  }
+  void insertAll() {
+    for (BsdElement &element : elements_) RB_INSERT(BsdTree, &tree_, &element);
+  }
+  void removeAll() {
+    for (BsdElement &element : elements_) RB_REMOVE(BsdTree, &tree_, &element);
+  }
+  void takeOutAndIn(size_t number) {
+    RB_REMOVE(BsdTree, &tree_, &elements_[number]);
+    RB_INSERT(BsdTree, &tree_, &elements_[number]);
+  }
+
+ private:
+  std::vector<BsdElement> elements_;
+  mutable BsdTree tree_; /* its macros know no const */
+};
+
+/* Its elements move: no node to keep, and it allocates. */
+class BTree {
+ public:
+  explicit BTree(const std::vector<zel_UUID> &keys) {
+    for (const zel_UUID &uuid : keys) keys_.push_back(wordsOf(uuid));
+    insertAll();
+  }
+  const uint32_t *find(const zel_UUID &uuid) const {
+    const auto found = map_.find(wordsOf(uuid));
+    return found == map_.end() ? nullptr : &found->second;
+  }
+  uint64_t iterate() const {
+    uint64_t sum = 0;
+    for (const auto &[words, number] : map_) sum += number;
+    return sum;
+  }
+  void insertAll() {
+    for (size_t i = 0; i < keys_.size(); i++) insert(i);
+  }
+  void removeAll() {
+    for (const Words &words : keys_) map_.erase(words);
+  }
+  void takeOutAndIn(size_t number) {
+    map_.erase(keys_[number]);
+    insert(number);
+  }
+
+ private:
+  void insert(size_t number) { map_.emplace(keys_[number], static_cast<uint32_t>(number)); }
+
+  std::vector<Words> keys_;
+  absl::btree_map<Words, uint32_t> map_;
+};
+
+}  // namespace bench

@@ -1,12 +1,13 @@
 /* Names, bars and processors; see bench.h. */
 #include "bench/bench.h"
 
-#include <pthread.h>
 #include <sched.h>
+#include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
+#include <filesystem>
 #include <stdexcept>
-#include <thread>
 
 #include "bench/registry.h"
 
@@ -25,9 +26,28 @@ cpu_set_t processorsAtHand() {
 }
 const cpu_set_t atHand = processorsAtHand();
 
-void runOn(const cpu_set_t &processors) {
-  if (pthread_setaffinity_np(pthread_self(), sizeof processors, &processors) != 0) {
-    throw std::runtime_error("a thread cannot be bound to its processor");
+/* The set of one processor. */
+cpu_set_t one(unsigned processor) {
+  unsigned skip = processor % static_cast<unsigned>(CPU_COUNT(&atHand));
+  int number = 0;
+  while (!CPU_ISSET(number, &atHand) || skip-- != 0) number++;
+  cpu_set_t set;
+  CPU_ZERO(&set);
+  CPU_SET(number, &set);
+  return set;
+}
+
+/* 0: the calling thread. False when there is no such thread. */
+bool runOn(pid_t thread, const cpu_set_t &processors) {
+  if (sched_setaffinity(thread, sizeof processors, &processors) == 0) return true;
+  if (errno == ESRCH) return false;
+  throw std::runtime_error("a thread cannot be bound to its processor");
+}
+
+void runOthersOn(const cpu_set_t &processors) {
+  for (const auto &task : std::filesystem::directory_iterator("/proc/self/task")) {
+    const pid_t thread = std::stoi(task.path().filename());
+    if (thread != gettid()) runOn(thread, processors);
   }
 }
 
@@ -90,18 +110,19 @@ void state(const std::string &text, double value, const std::string &unit) {
 }
 
 void pin(unsigned processor) {
-  unsigned skip = processor % static_cast<unsigned>(CPU_COUNT(&atHand));
-  for (int number = 0; number < CPU_SETSIZE; number++) {
-    if (!CPU_ISSET(number, &atHand) || skip-- != 0) continue;
-    cpu_set_t one;
-    CPU_ZERO(&one);
-    CPU_SET(number, &one);
-    return runOn(one);
-  }
+  runOn(0, one(processor));
 }
 
 void unpin() {
-  runOn(atHand);
+  runOn(0, atHand);
+}
+
+OthersPinned::OthersPinned(unsigned processor) {
+  runOthersOn(one(processor));
+}
+
+OthersPinned::~OthersPinned() {
+  runOthersOn(atHand);
 }
 
 }  // namespace bench

@@ -78,4 +78,14 @@ void state(const std::string &text, double value, const std::string &unit);
 void pin(unsigned processor);
 void unpin();
 
+/* In its life all other threads that there were at its beginning, the kernel's too, and those that they
+ * start, run on that processor only; afterwards on all of them. */
+class OthersPinned {
+ public:
+  explicit OthersPinned(unsigned processor);
+  ~OthersPinned();
+  OthersPinned(const OthersPinned &) = delete;
+  OthersPinned &operator=(const OthersPinned &) = delete;
+};
+
 }  // namespace bench

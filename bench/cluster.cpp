@@ -9,10 +9,11 @@ namespace {
 
 enum : uint8_t { NODE = 1, INTERFACE = 2 };
 
-zel_UUID uuidOf(uint8_t kind, uint8_t number) {
+zel_UUID uuidOf(uint8_t kind, uint8_t number, uint8_t below = 0) {
   zel_UUID uuid{};
   uuid.bytes[0] = kind;
-  uuid.bytes[15] = number;
+  uuid.bytes[14] = number;
+  uuid.bytes[15] = below;
   return uuid;
 }
 
@@ -22,22 +23,39 @@ host::KernelSettings settings() {
   return settings;
 }
 
-host::Entry interfaceEntry(uint8_t number, uint8_t version) {
+}  // namespace
+
+zel_UUID nodeUUID(uint8_t node) {
+  return uuidOf(NODE, node);
+}
+
+zel_UUID interfaceUUID(uint8_t node, uint8_t interface) {
+  return uuidOf(INTERFACE, node, interface);
+}
+
+host::Entry nodeEntry(uint8_t node) {
+  return {KARST_TYPE_NODE, nodeUUID(node), nodeUUID(node), host::encode(KarstNodeEntry{})};
+}
+
+host::Entry interfaceEntry(uint8_t node, uint8_t interface, uint8_t version) {
   KarstNetInterfaceEntry record{};
   record.networkType = KARST_NETWORK_TYPE_IP;
   record.numIpAddresses = KARST_RESOLVER_MAX_LOCATORS;
   for (uint8_t i = 0; i < KARST_RESOLVER_MAX_LOCATORS; i++) {
     uint8_t *address = record.ipAddresses[i].address;
     address[0] = 10;
-    address[1] = number;
+    address[1] = node;
     address[2] = version;
-    address[3] = i;
+    address[3] = static_cast<uint8_t>(interface * KARST_RESOLVER_MAX_LOCATORS + i);
   }
-  return {KARST_TYPE_NET_INTERFACE, uuidOf(INTERFACE, number), uuidOf(NODE, number),
+  return {KARST_TYPE_NET_INTERFACE, interfaceUUID(node, interface), nodeUUID(node),
           host::encode(record)};
 }
 
-}  // namespace
+host::Entry healthEntry(uint8_t node, uint8_t interface) {
+  return {KARST_TYPE_HEALTH_STATUS, interfaceUUID(node, interface), nodeUUID(node),
+          host::encode(KarstHealthStatusEntry{})};
+}
 
 Cluster::Cluster()
     : kernel(settings()),
@@ -48,9 +66,21 @@ Cluster::Cluster()
       setCallback(inModule<decltype(KARSTResolver_SetCallback)>("KARSTResolver_SetCallback")),
       getNodeLocators(
           inModule<decltype(KARSTResolver_GetNodeLocators)>("KARSTResolver_GetNodeLocators")) {
-  kernel.directory().setSelf(uuidOf(NODE, 0));
-  kernel.directory().setUsable(true);
+  host::Directory &directory = kernel.directory();
+  directory.setSelf(nodeUUID(0));
+  for (uint8_t node = 0; node < NODES; node++) {
+    directory.put(nodeEntry(node));
+    for (uint8_t interface = 0; interface < INTERFACES_OF_A_NODE; interface++) {
+      directory.put(interfaceEntry(node, interface, 0));
+      directory.put(healthEntry(node, interface));
+    }
+  }
+  directory.setUsable(true);
   kernel.settle();
+}
+
+host::HeapState Cluster::heap() const {
+  return host::heapState(*inModule<zel_HeapID>("karstResolverHeapID"));
 }
 
 void *Cluster::symbol(const char *name) const {
@@ -60,25 +90,37 @@ void *Cluster::symbol(const char *name) const {
 }
 
 WatchedNode::WatchedNode(Cluster &cluster, uint8_t number, size_t instances)
-    : cluster_(cluster), changes_{interfaceEntry(number, 1), interfaceEntry(number, 2)} {
-  const zel_UUID node = uuidOf(NODE, number);
-  host::Directory &directory = cluster.kernel.directory();
-  directory.put({KARST_TYPE_NODE, node, node, host::encode(KarstNodeEntry{})});
-  directory.put(interfaceEntry(number, 0));
-  directory.put({KARST_TYPE_HEALTH_STATUS, uuidOf(INTERFACE, number), node,
-                 host::encode(KarstHealthStatusEntry{})});
-  cluster.kernel.settle();
+    : cluster_(cluster), changes_{interfaceEntry(number, 0, 1), interfaceEntry(number, 0, 2)} {
+  /* Others may have had the node before. */
+  const auto present = cluster.kernel.directory().entry(changes_[0].type, changes_[0].uuid);
+  if (present == changes_[0]) changed_ = 1;
   while (instances_.size() < instances) {
     KARSTResolverInstance *instance = nullptr;
-    const zel_Status status = cluster.create(&instance, 0, zel_UUID{}, node, false);
+    const zel_Status status = cluster.create(&instance, 0, zel_UUID{}, nodeUUID(number), false);
     if (status != ZEL_OK) throw std::runtime_error(zel_StatusToString(status));
-    cluster.setCallback(instance, instances_.empty() ? toldAndTimed : told, this);
+    const bool timed = instances_.empty() || instances_.size() + 1 == instances;
     instances_.push_back(instance);
+    cluster.setCallback(instance, timed ? toldAndTimed : told, this);
   }
 }
 
 WatchedNode::~WatchedNode() {
   for (KARSTResolverInstance *instance : instances_) cluster_.destroy(instance);
+}
+
+bool WatchedNode::change(Clock::time_point *start) {
+  host::Entry entry = nextChange();
+  const uint64_t before = calls_;
+  *start = Clock::now();
+  cluster_.kernel.directory().put(std::move(entry));
+  cluster_.kernel.settle();
+  return calls_ == before + instances_.size();
+}
+
+/* The list is walked from either end in turn. */
+Clock::duration WatchedNode::span() const {
+  const Clock::time_point first = first_, last = last_;
+  return first < last ? last - first : first - last;
 }
 
 /* Calls of different instances come from one thread at a time, the resolver's: no need to add
@@ -89,7 +131,9 @@ void WatchedNode::told(void *data, KARSTResolverInstance *, uint32_t) {
 }
 
 void WatchedNode::toldAndTimed(void *data, KARSTResolverInstance *instance, uint32_t state) {
-  static_cast<WatchedNode *>(data)->lastCall_ = Clock::now();
+  auto *node = static_cast<WatchedNode *>(data);
+  const Clock::time_point now = Clock::now();
+  (instance == node->instance() ? node->first_ : node->last_) = now;
   told(data, instance, state);
 }
 

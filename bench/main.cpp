@@ -29,10 +29,13 @@ void write(const std::string &file, const nlohmann::ordered_json &json) {
 int run(const std::string &jsonFile) {
   bench::Cluster cluster; /* its threads run on all processors */
   bench::pin(0);
+  bench::measureMemory(cluster);
   bench::measureMap(cluster);
   bench::measureTrace(cluster);
   bench::measureReadOut(cluster);
   bench::measureChange(cluster);
+  bench::measureRefreshes(cluster);
+  bench::measureRescan(cluster);
 
   printLoad("before");
   bench::Figures figures;

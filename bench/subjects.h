@@ -9,5 +9,8 @@ void measureMap(const Cluster &cluster);
 void measureTrace(Cluster &cluster);
 void measureReadOut(Cluster &cluster);
 void measureChange(Cluster &cluster);
+void measureRefreshes(Cluster &cluster);
+void measureRescan(Cluster &cluster);
+void measureMemory(Cluster &cluster); /* first: while nobody has instances */
 
 }  // namespace bench

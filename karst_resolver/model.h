@@ -152,6 +152,7 @@ struct KARSTResolverCache {
   KARSTRBTree *nodeTree KARST_POINTS_TO_GUARDED_BY(karstResolverCacheLock);
   KARSTResolverLink netIfs KARST_GUARDED_BY(karstResolverCacheLock); /* in order of creation */
   KARSTResolverLink dirtyNodes KARST_GUARDED_BY(karstResolverCacheLock);
+  uint32_t unwatchedNetIfs KARST_GUARDED_BY(karstResolverCacheLock); /* in `netIfs`, no healthSub */
 };
 
 /* ---- Instance -------------------------------------------------------------------------------- */

@@ -43,6 +43,7 @@ KARSTResolverNetIf *KARSTResolverFindOrCreateNetIf(KARSTResolverCache *cache, ze
                          &netIf->uuid);
   netIf->cache = cache;
   KARSTResolverListAppend(&cache->netIfs, &netIf->cacheLinks);
+  cache->unwatchedNetIfs++;
   node->refCount++;
   netIf->node = node;
   KARSTResolverListAppend(&node->netIfList, &netIf->nodeLinks);
@@ -138,6 +139,8 @@ void KARSTResolverDestroyNetIf(KARSTResolverCache *cache, KARSTResolverNetIf *ne
   if (netIf->healthSubInstalled) {
     KARST_Unsubscribe(&netIf->healthSub, KARSTResolverNetIfHealthSubCbk, netIf);
     netIf->healthSubInstalled = 0;
+  } else {
+    cache->unwatchedNetIfs--;
   }
   KARSTResolverReleaseNetIf(cache, netIf);
 }

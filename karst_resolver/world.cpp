@@ -14,6 +14,7 @@ extern "C" {
  * tried again in the next. The references are taken first: the last call may come at any time. */
 static void KARSTResolverInstallHealthSubs(KARSTResolverCache *cache)
     KARST_REQUIRES(karstResolverCacheLock) {
+  if (cache->unwatchedNetIfs == 0) return; /* no walk over all interfaces for one that changed */
   for (KARSTResolverLink *link = cache->netIfs.next; link != &cache->netIfs; link = link->next) {
     KARSTResolverNetIf *netIf = KARST_RESOLVER_CONTAINER(link, KARSTResolverNetIf, cacheLinks);
     if (netIf->healthSubInstalled) continue;
@@ -21,6 +22,7 @@ static void KARSTResolverInstallHealthSubs(KARSTResolverCache *cache)
     netIf->refCount++;
     if (KARST_Subscribe(&netIf->healthSub, KARSTResolverNetIfHealthSubCbk, netIf) == ZEL_OK) {
       netIf->healthSubInstalled = 1;
+      cache->unwatchedNetIfs--;
     } else {
       netIf->refCount--; /* its place in the cache keeps it alive */
       KARSTResolverCountDown(&cache->refCount);

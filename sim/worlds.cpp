@@ -85,6 +85,10 @@ namespace host {
  * lock for too long is the simulation's choice. */
 void configureWorlds(const WorldSettings &) {}
 
+/* Nothing to put off either: a wake-up here takes the processor from nobody. */
+WakeUpsPutOff::WakeUpsPutOff() {}
+WakeUpsPutOff::~WakeUpsPutOff() {}
+
 void waitUntilWorldsIdle() {
   sim::Machine &machine = sim::Machine::current();
   while (!machine.worlds().allIdle())

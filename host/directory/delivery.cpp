@@ -27,12 +27,23 @@ void Delivery::end() {
   threads_.clear();
 }
 
-void Delivery::schedule(const std::shared_ptr<Recipient> &recipient) {
-  /* One that is being served is put back by its thread. */
-  if (recipient->listed_ || recipient->running() || !recipient->due()) return;
+/* One that is being served is put back by its thread. */
+bool Delivery::list(const std::shared_ptr<Recipient> &recipient) {
+  if (recipient->listed_ || recipient->running() || !recipient->due()) return false;
   recipient->listed_ = true;
   ready_.push_back(recipient);
-  due_.notifyOne();
+  return true;
+}
+
+void Delivery::schedule(const std::shared_ptr<Recipient> &recipient) {
+  if (list(recipient)) ++unannounced_;
+}
+
+void Delivery::announce(std::unique_lock<Mutex> &lock) {
+  const size_t recipients = std::exchange(unannounced_, 0);
+  lock.unlock();
+  if (recipients == 1) due_.notifyOne();
+  if (recipients > 1) due_.notifyAll();
 }
 
 void Delivery::work(size_t worker) {
@@ -50,10 +61,12 @@ void Delivery::work(size_t worker) {
       recipient->serve(lock);
       recipient->caller_ = nullptr;
       running_[worker] = 0;
-      schedule(recipient);
+      list(recipient); /* nobody need be woken: this thread looks again */
       onReturn_();
+      if (std::exchange(unannounced_, 0) != 0) due_.notifyAll();
     }
     returned_.notifyAll();
+    if (idle()) idle_.notifyAll();
   }
 }
 
@@ -68,7 +81,7 @@ bool Delivery::idle() const {
 
 void Delivery::waitUntilIdle(std::unique_lock<Mutex> &lock) {
   while (!idle()) {
-    returned_.wait(lock, {"until the directory has nothing to deliver", false});
+    idle_.wait(lock, {"until the directory has nothing to deliver", false});
   }
 }
 

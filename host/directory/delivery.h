@@ -52,8 +52,12 @@ class Delivery {
 
   /* The functions below are called with the lock held. */
 
-  /* Notes that the recipient has something due; harmless when it has not. Never blocks. */
+  /* Notes that the recipient has something due; harmless when it has not. Never blocks. A thread
+   * makes the call once announce() was called. */
   void schedule(const std::shared_ptr<Recipient> &recipient);
+
+  /* Wakes threads for what was scheduled. Gives the lock up first: a thread that wakes needs it. */
+  void announce(std::unique_lock<Mutex> &lock);
 
   bool idle() const; /* nothing is due and no call runs */
 
@@ -67,13 +71,16 @@ class Delivery {
   bool anyRunning(uint64_t lastCall) const; /* of the calls up to that one */
 
  private:
+  bool list(const std::shared_ptr<Recipient> &recipient);
   void work(size_t worker);
 
   Mutex &mutex_;
   const std::function<void()> onReturn_;
   Condition due_;      /* the ready list has grown, or the end has come */
   Condition returned_; /* a call has returned */
+  Condition idle_;     /* the last one has */
   std::deque<std::shared_ptr<Recipient>> ready_;
+  size_t unannounced_ = 0; /* recipients in the ready list that no thread was woken for */
   uint64_t calls_ = 0;
   std::vector<uint64_t> running_; /* by thread: number of the call that it makes, or 0 */
   bool ending_ = false;

@@ -21,7 +21,21 @@ namespace {
 struct Key {
   uint8_t type;
   zel_UUID uuid; /* zero in a subscription: every entry of the type */
-  auto operator<=>(const Key &) const = default;
+  bool operator==(const Key &) const = default;
+  /* Byte by byte, by eight bytes at a time. */
+  auto operator<=>(const Key &other) const {
+    if (type != other.type) return type <=> other.type;
+    const uint64_t first = wordAt(0), otherFirst = other.wordAt(0);
+    if (first != otherFirst) return first <=> otherFirst;
+    return wordAt(8) <=> other.wordAt(8);
+  }
+
+ private:
+  uint64_t wordAt(size_t offset) const {
+    uint64_t word;
+    std::memcpy(&word, uuid.bytes + offset, sizeof word);
+    return __builtin_bswap64(word); /* the first byte weighs most */
+  }
 };
 
 /* The directory's own bytes of a header: they tell that it is the directory's, and of which type
@@ -72,10 +86,12 @@ Entries::const_iterator firstMatch(const Entries &entries, const Key &key) {
   return first != entries.end() && first->first.type == key.type ? first : entries.end();
 }
 
-/* The first one behind `after`, or the end. */
-Entries::const_iterator nextMatch(const Entries &entries, const Key &key, const Key &after) {
+/* The first one behind `after`, or the end. `walked` is a guess where that is, or the end. */
+Entries::const_iterator nextMatch(const Entries &entries, const Key &key, const Key &after,
+                                  Entries::const_iterator walked) {
   if (!isZero(key.uuid)) return entries.end();
-  const auto next = entries.upper_bound(after);
+  const bool guessed = walked != entries.end() && walked->first == after;
+  const auto next = guessed ? std::next(walked) : entries.upper_bound(after);
   return next != entries.end() && next->first.type == key.type ? next : entries.end();
 }
 
@@ -107,6 +123,7 @@ struct Directory::Impl {
   SharedEntry exactly(const Key &key);
 
   /* With the lock held. */
+  Entries::const_iterator find(const Key &key) const;
   void tell(const std::shared_ptr<Subscription> &subscription, const KarstEntryHeader &header,
             zel_Status status);
   void tellMatching(const Entry &entry, zel_Status status);
@@ -118,6 +135,9 @@ struct Directory::Impl {
   Mutex mutex;
   /* Guarded by the mutex, to the end. */
   Entries entries;
+  /* Where the last walk stands, or the end: its next step, and reading the entry that it was told of,
+   * need no search. */
+  Entries::const_iterator walked = entries.end();
   zel_UUID self{};
   bool usable = false;
   bool interrupted = false; /* from unusable after usable to the end that settle() finds */
@@ -130,16 +150,34 @@ struct Directory::Impl {
   Delivery delivery; /* ends first: its threads use the rest */
 };
 
+/* The lock of whoever may schedule calls, which are announced when it is given back. */
+class Announcing {
+ public:
+  explicit Announcing(Mutex &mutex, Delivery &delivery) : lock_(mutex), delivery_(delivery) {}
+  ~Announcing() { delivery_.announce(lock_); }
+  Announcing(const Announcing &) = delete;
+  Announcing &operator=(const Announcing &) = delete;
+  std::unique_lock<Mutex> &lock() { return lock_; }
+
+ private:
+  std::unique_lock<Mutex> lock_;
+  Delivery &delivery_;
+};
+
 SharedEntry Directory::Impl::firstOf(const Key &wanted) {
   const std::lock_guard<Mutex> lock(mutex);
-  const auto found = firstMatch(entries, wanted);
+  const auto found = isZero(wanted.uuid) ? firstMatch(entries, wanted) : find(wanted);
   return found != entries.end() ? found->second : nullptr;
 }
 
 SharedEntry Directory::Impl::exactly(const Key &key) {
   const std::lock_guard<Mutex> lock(mutex);
-  const auto found = entries.find(key);
+  const auto found = find(key);
   return found != entries.end() ? found->second : nullptr;
+}
+
+Entries::const_iterator Directory::Impl::find(const Key &key) const {
+  return walked != entries.end() && walked->first == key ? walked : entries.find(key);
 }
 
 void Directory::Impl::tell(const std::shared_ptr<Subscription> &subscription,
@@ -164,7 +202,7 @@ void Directory::Impl::tellMissed(Subscription &subscription, const Key &key) con
   /* Who follows one entry looks it up, and is not to be misled by an owner of the past. */
   if (!interrupted || !isZero(key.uuid)) return;
   for (auto it = firstMatch(missed, key); it != missed.end();
-       it = nextMatch(missed, key, it->first)) {
+       it = nextMatch(missed, key, it->first, it)) {
     const KarstEntryHeader header = headerOf(*it->second);
     subscription.tellAtStart(header, ZEL_OK);
     subscription.tellAtStart(header, ZEL_NOT_FOUND);
@@ -225,7 +263,7 @@ zel_UUID Directory::self() const {
 /* ---- Status ---------------------------------------------------------------------------------- */
 
 void Directory::setUsable(bool usable) {
-  const std::lock_guard<Mutex> lock(impl_->mutex);
+  const Announcing announcing(impl_->mutex, impl_->delivery);
   if (impl_->usable == usable) return;
   impl_->usable = usable;
   if (!usable) impl_->interrupted = true;
@@ -241,7 +279,7 @@ void Directory::setUsable(bool usable) {
 zel_Status Directory::registerStatus(KarstStatusFn fn, void *data) {
   if (fn == nullptr) return ZEL_BAD_PARAM;
   const auto registration = std::make_shared<StatusRegistration>(fn, data);
-  const std::lock_guard<Mutex> lock(impl_->mutex);
+  const Announcing announcing(impl_->mutex, impl_->delivery);
   impl_->registrations.push_back(registration);
   if (impl_->usable) {
     registration->tellChange();
@@ -251,7 +289,7 @@ zel_Status Directory::registerStatus(KarstStatusFn fn, void *data) {
 }
 
 void Directory::deregisterStatus(KarstStatusFn fn, void *data) {
-  std::unique_lock<Mutex> lock(impl_->mutex);
+  Announcing announcing(impl_->mutex, impl_->delivery);
   std::vector<std::shared_ptr<StatusRegistration>> removed;
   for (const auto &registration : impl_->registrations) {
     if (!registration->is(fn, data)) continue;
@@ -259,7 +297,7 @@ void Directory::deregisterStatus(KarstStatusFn fn, void *data) {
     removed.push_back(registration);
   }
   for (const auto &registration : removed) {
-    impl_->delivery.waitUntilReturned(*registration, lock);
+    impl_->delivery.waitUntilReturned(*registration, announcing.lock());
   }
   /* One that still runs, because this call came from inside it, stays for others to wait for. */
   std::erase_if(impl_->registrations, [](const auto &registration) {
@@ -272,7 +310,7 @@ void Directory::deregisterStatus(KarstStatusFn fn, void *data) {
 
 void Directory::put(Entry entry) {
   const auto present = std::make_shared<const Entry>(std::move(entry));
-  const std::lock_guard<Mutex> lock(impl_->mutex);
+  const Announcing announcing(impl_->mutex, impl_->delivery);
   const Key key{present->type, present->uuid};
   impl_->missed.erase(key);
   SharedEntry &place = impl_->entries[key];
@@ -285,11 +323,12 @@ void Directory::put(Entry entry) {
 }
 
 void Directory::remove(uint8_t type, const zel_UUID &uuid) {
-  const std::lock_guard<Mutex> lock(impl_->mutex);
+  const Announcing announcing(impl_->mutex, impl_->delivery);
   const Key key{type, uuid};
   const auto place = impl_->entries.find(key);
   if (place == impl_->entries.end()) return;
   const SharedEntry before = std::move(place->second);
+  if (impl_->walked == place) impl_->walked = impl_->entries.end();
   impl_->entries.erase(place);
   impl_->missed.insert_or_assign(key, before);
   impl_->tellMatching(*before, ZEL_NOT_FOUND);
@@ -297,7 +336,7 @@ void Directory::remove(uint8_t type, const zel_UUID &uuid) {
 }
 
 void Directory::resync() {
-  const std::lock_guard<Mutex> lock(impl_->mutex);
+  const Announcing announcing(impl_->mutex, impl_->delivery);
   impl_->tellResync();
 }
 
@@ -307,14 +346,14 @@ zel_Status Directory::subscribe(const KarstQuery *query, KarstSubscriptionFn fn,
   if (query == nullptr || fn == nullptr) return ZEL_BAD_PARAM;
   const std::optional<Key> key = keyOf(*query);
   if (!key) return ZEL_BAD_PARAM;
-  const std::lock_guard<Mutex> lock(impl_->mutex);
+  const Announcing announcing(impl_->mutex, impl_->delivery);
   const auto subscription = std::make_shared<Subscription>(query, fn, data, impl_->queueBound,
                                                            &impl_->subscriptionsAlive);
   /* In one go with the installation: what changes next is told behind what is there now. What is
    * gone comes first, so that a reader has its room free again for what is there. */
   impl_->tellMissed(*subscription, *key);
   for (auto it = firstMatch(impl_->entries, *key); it != impl_->entries.end();
-       it = nextMatch(impl_->entries, *key, it->first)) {
+       it = nextMatch(impl_->entries, *key, it->first, it)) {
     subscription->tellAtStart(headerOf(*it->second), ZEL_OK);
   }
   /* Who looked one entry up before it subscribed may have found what is gone by now. */
@@ -329,7 +368,7 @@ zel_Status Directory::subscribe(const KarstQuery *query, KarstSubscriptionFn fn,
 void Directory::unsubscribe(const KarstQuery *query, KarstSubscriptionFn fn, void *data) {
   const std::optional<Key> key = query != nullptr ? keyOf(*query) : std::nullopt;
   if (!key) return;
-  const std::lock_guard<Mutex> lock(impl_->mutex);
+  const Announcing announcing(impl_->mutex, impl_->delivery);
   const auto [first, last] = impl_->installed.equal_range(*key);
   const auto it = std::find_if(
       first, last, [=](const auto &place) { return place.second->is(query, fn, data); });
@@ -349,8 +388,9 @@ zel_Status Directory::findEntry(const KarstQuery &query, uint32_t next,
   const std::optional<Key> after = next == 1 ? keyOf(*header) : key;
   if (!after || after->type != key->type) return ZEL_BAD_PARAM;
   const std::lock_guard<Mutex> lock(impl_->mutex);
-  const auto found =
-      next == 1 ? nextMatch(impl_->entries, *key, *after) : firstMatch(impl_->entries, *key);
+  const auto found = next == 1 ? nextMatch(impl_->entries, *key, *after, impl_->walked)
+                               : firstMatch(impl_->entries, *key);
+  impl_->walked = found;
   if (found == impl_->entries.end()) return ZEL_NOT_FOUND;
   *header = headerOf(*found->second);
   return ZEL_OK;
@@ -383,7 +423,7 @@ std::vector<Entry> Directory::entries(uint8_t type) const {
   std::vector<Entry> result;
   const std::lock_guard<Mutex> lock(impl_->mutex);
   for (auto it = firstMatch(impl_->entries, key); it != impl_->entries.end();
-       it = nextMatch(impl_->entries, key, it->first)) {
+       it = nextMatch(impl_->entries, key, it->first, it)) {
     result.push_back(*it->second);
   }
   return result;

@@ -106,14 +106,27 @@ zel_Status encodeField(ExprMshWriter &writer, const ExprMshField &row, const voi
   }
 }
 
+/* The row of this name, or null. Most writers keep to the order of the table: the search begins at
+ * `next`, the row behind the last one found, and goes around. */
+const ExprMshField *findRow(const ExprMshField *table, const ExprMshField *next,
+                            std::string_view name) {
+  for (const ExprMshField *row = next; row->name != nullptr; ++row) {
+    if (name == row->name) return row;
+  }
+  for (const ExprMshField *row = table; row != next; ++row) {
+    if (name == row->name) return row;
+  }
+  return nullptr;
+}
+
 zel_Status decodePair(ExprMshReader &reader, const ExprMshField *table, void *record,
-                      uint64_t *seen) {
+                      const ExprMshField **next, uint64_t *seen) {
   std::string_view name;
   const zel_Status status = readName(reader, &name);
   if (status != ZEL_OK) return status;
-  const ExprMshField *row = table;
-  while (row->name != nullptr && name != row->name) ++row;
-  if (row->name == nullptr) return skipValue(reader);
+  const ExprMshField *row = findRow(table, *next, name);
+  if (row == nullptr) return skipValue(reader);
+  *next = row + 1;
   const uint64_t bit = uint64_t{1} << (row - table);
   if ((*seen & bit) != 0) return EXPR_MSH_MALFORMED;
   *seen |= bit;
@@ -125,12 +138,13 @@ zel_Status decodeRecord(ExprMshReader &reader, const ExprMshField *table, void *
   CborContainer map;
   zel_Status status = openMap(reader, &map);
   if (status == EXPR_MSH_BAD_TYPE) return EXPR_MSH_MALFORMED;
+  const ExprMshField *next = table;
   uint64_t seen = 0;
   bool more = true;
   while (status == ZEL_OK) {
     status = nextElement(reader, &map, &more);
     if (status != ZEL_OK || !more) break;
-    status = decodePair(reader, table, record, &seen);
+    status = decodePair(reader, table, record, &next, &seen);
   }
   if (status == ZEL_OK && reader.position != reader.length) return EXPR_MSH_TRAILING;
   return status;

@@ -1,6 +1,8 @@
 /* Subscriptions and status registrations: their queues and their calls. Lock: the directory's. */
 #include "host/directory/recipients.h"
 
+#include "host/threads/worlds.h"
+
 namespace host {
 
 Subscription::Subscription(const KarstQuery *query, KarstSubscriptionFn fn, void *data,
@@ -57,7 +59,10 @@ void Subscription::serve(std::unique_lock<Mutex> &lock) {
   /* Before the call: what changes from here on may be missed by what the call reads. */
   if (call.status == ZEL_SUB_OVERFLOW) overflowed_ = false;
   lock.unlock();
-  fn_(data_, &call.header, nullptr, call.status);
+  {
+    const WakeUpsPutOff putOff;
+    fn_(data_, &call.header, nullptr, call.status);
+  }
   lock.lock();
 }
 

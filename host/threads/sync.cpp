@@ -3,11 +3,11 @@
  */
 #include "host/threads/sync.h"
 
-#include <condition_variable>
 #include <thread>
 
 #include "host/threads/spinlock.h"
 #include "host/threads/thread_name.h"
+#include "host/threads/wake_up.h"
 
 namespace host {
 
@@ -25,22 +25,23 @@ void Mutex::unlock() {
 }
 
 struct Condition::Impl {
-  std::condition_variable condition;
+  WakeUp wakeUp;
 };
 
 Condition::Condition() : impl_(std::make_unique<Impl>()) {}
 Condition::~Condition() = default;
 void Condition::notifyOne() {
-  impl_->condition.notify_one();
+  impl_->wakeUp.one();
 }
 void Condition::notifyAll() {
-  impl_->condition.notify_all();
+  impl_->wakeUp.all();
 }
 
 void Condition::wait(std::unique_lock<Mutex> &lock, WaitReason reason) {
   requireNoSpinlock("waits", reason.text);
+  makeWakeUps();
   std::unique_lock<std::mutex> held(lock.mutex()->impl_->mutex, std::adopt_lock);
-  impl_->condition.wait(held);
+  impl_->wakeUp.wait(held);
   held.release(); /* the caller's lock goes on owning the mutex */
 }
 

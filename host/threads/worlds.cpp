@@ -11,10 +11,12 @@
 #include <atomic>
 #include <condition_variable>
 #include <map>
+#include <memory>
 #include <mutex>
 #include <new>
 #include <system_error>
 #include <thread>
+#include <utility>
 
 #include "host/kernel/heap.h"
 #include "host/kernel/panic.h"
@@ -22,6 +24,7 @@
 #include "host/threads/spinlock.h"
 #include "host/threads/thread_name.h"
 #include "host/threads/thread_report.h"
+#include "host/threads/wake_up.h"
 #include "platform/tolm.h"
 
 namespace host {
@@ -44,7 +47,9 @@ struct World {
   bool released = false;        /* its ID is known to its creator: the body may run */
   bool woken = false;           /* a wake-up that no wait has used up yet */
   bool stopping = false;
-  std::condition_variable wake{};
+  /* Shared with whoever wakes it up: that is done after the mutex was given back, or the world would
+   * run straight into it; and by then the world may have ended. */
+  std::shared_ptr<WakeUp> wake = std::make_shared<WakeUp>();
 };
 
 struct Worlds {
@@ -63,6 +68,11 @@ Worlds &worlds() {
 std::atomic<int64_t> stopTimeoutMilliseconds{30'000};
 
 thread_local World *currentWorld = nullptr;
+
+/* Of the calling thread: does it put wake-ups off, and which it has. A second world that it wakes
+ * meanwhile makes the first one's due. */
+thread_local bool putsOff = false;
+thread_local std::shared_ptr<WakeUp> putOff;
 
 /* The next number that no living world has: a number comes back only after all others were used. */
 zel_WorldID newIDLocked(Worlds &all) {
@@ -107,7 +117,7 @@ void runWorld(World &world) {
   currentWorld = &world;
   {
     std::unique_lock guard(all.mutex);
-    world.wake.wait(guard, [&] { return world.released; });
+    while (!world.released) world.wake->wait(guard);
     world.state = WorldState::Running;
   }
   world.body(world.data);
@@ -116,6 +126,21 @@ void runWorld(World &world) {
   const std::lock_guard guard(all.mutex);
   world.state = WorldState::Ended;
   all.settled.notify_all();
+}
+
+/* Until the world is woken or asked to stop, or for so many milliseconds. */
+void sleepUntilDue(World &world, std::unique_lock<std::mutex> &guard, uint32_t timeout) {
+  using Clock = std::chrono::steady_clock;
+  const auto end = Clock::now() + std::chrono::milliseconds(timeout);
+  while (!world.woken && !world.stopping) {
+    if (timeout == ZEL_TIMEOUT_NONE) {
+      world.wake->wait(guard);
+      continue;
+    }
+    const auto left = end - Clock::now();
+    if (left <= left.zero()) return;
+    world.wake->wait(guard, left);
+  }
 }
 
 void dispose(World *world) {
@@ -140,7 +165,7 @@ World *markStopping(Worlds &all, zel_WorldID id) {
     if (found != all.alive.end() && !found->second->stopping && found->second != currentWorld) {
       World *world = found->second;
       world->stopping = true;
-      world->wake.notify_one();
+      world->wake->one();
       return world;
     }
   }
@@ -155,6 +180,19 @@ World *markStopping(Worlds &all, zel_WorldID id) {
 void configureWorlds(const WorldSettings &settings) {
   stopTimeoutMilliseconds = settings.stopTimeout.count();
   setLockSlice(settings.lockSlice);
+}
+
+void makeWakeUps() {
+  if (putOff != nullptr) std::exchange(putOff, nullptr)->one();
+}
+
+WakeUpsPutOff::WakeUpsPutOff() {
+  putsOff = true;
+}
+
+WakeUpsPutOff::~WakeUpsPutOff() {
+  putsOff = false;
+  makeWakeUps();
 }
 
 void waitUntilWorldsIdle() {
@@ -213,7 +251,7 @@ extern "C" zel_Status TOLM_WorldCreate(zel_WorldID *world, const char *name, zel
    * the body makes others do finds the ID in its place. */
   std::atomic_ref(*world).store(created->id, std::memory_order_release);
   created->released = true;
-  created->wake.notify_one();
+  created->wake->one();
   return ZEL_OK;
 }
 
@@ -221,6 +259,7 @@ extern "C" void TOLM_WorldDestroy(zel_WorldID *world) {
   const zel_WorldID id = std::atomic_ref(*world).load(std::memory_order_acquire);
   if (id == ZEL_NO_WORLD) return;
   requireNoSpinlock("destroys a world", std::to_string(id).c_str());
+  makeWakeUps();
   Worlds &all = worlds();
   World *ending = markStopping(all, id);
   {
@@ -258,12 +297,7 @@ extern "C" zel_Status zel_WorldWait(uint64_t event, zel_SpinlockHandle lock, uin
   world->reason = reason;
   ++all.activity;
   all.settled.notify_all();
-  const auto due = [&] { return world->woken || world->stopping; };
-  if (timeout == ZEL_TIMEOUT_NONE) {
-    world->wake.wait(guard, due);
-  } else {
-    world->wake.wait_for(guard, std::chrono::milliseconds(timeout), due);
-  }
+  sleepUntilDue(*world, guard, timeout);
   world->state = WorldState::Running;
   ++all.activity;
   world->woken = false;
@@ -271,16 +305,25 @@ extern "C" zel_Status zel_WorldWait(uint64_t event, zel_SpinlockHandle lock, uin
 }
 
 extern "C" void zel_WorldForceWakeup(zel_WorldID id) {
-  Worlds &all = worlds();
-  const std::lock_guard guard(all.mutex);
-  const auto found = all.alive.find(id);
-  if (found == all.alive.end()) return;
-  found->second->woken = true;
-  found->second->wake.notify_one();
+  std::shared_ptr<WakeUp> wake;
+  {
+    Worlds &all = worlds();
+    const std::lock_guard guard(all.mutex);
+    const auto found = all.alive.find(id);
+    if (found == all.alive.end()) return;
+    World &world = *found->second;
+    /* One that runs, or has been woken already, looks before it waits. */
+    if (!world.woken && world.state == WorldState::Waiting) wake = world.wake;
+    world.woken = true;
+  }
+  if (wake == nullptr) return;
+  if (putsOff) std::swap(wake, putOff);
+  if (wake != nullptr) wake->one();
 }
 
 extern "C" void zel_WorldSleep(uint32_t microseconds) {
   requireNoSpinlock("sleeps", "zel_WorldSleep");
+  makeWakeUps();
   const auto setState = [](WorldState state) {
     if (currentWorld == nullptr) return;
     const std::lock_guard guard(worlds().mutex);

@@ -21,6 +21,17 @@ struct WorldSettings {
 /* Takes effect at once, for stops and holds that begin later. Any thread, under any lock. */
 void configureWorlds(const WorldSettings &settings);
 
+/* In its life a wake-up that the calling thread asks for is put off until its end, or until the thread
+ * blocks: modules wake their worlds under a lock, which the world would run straight into, and, on the
+ * processor of its holder, keep it from giving it back. Not one inside another. */
+class WakeUpsPutOff {
+ public:
+  WakeUpsPutOff();
+  ~WakeUpsPutOff();
+  WakeUpsPutOff(const WakeUpsPutOff &) = delete;
+  WakeUpsPutOff &operator=(const WakeUpsPutOff &) = delete;
+};
+
 /* Returns when every world sleeps in its wait with no wake-up pending, or has ended. Blocks; not
  * from a world, which panics. */
 void waitUntilWorldsIdle();

@@ -68,7 +68,7 @@ Structure cacheStructure() {
                      FIELD(Cache, nodePool, Constant), FIELD(Cache, netIfPool, Constant),
                      FIELD(Cache, freeNodes, Lock), FIELD(Cache, freeNetIfs, Lock),
                      FIELD(Cache, nodeTree, Constant), FIELD(Cache, netIfs, Lock),
-                     FIELD(Cache, dirtyNodes, Lock)},
+                     FIELD(Cache, dirtyNodes, Lock), FIELD(Cache, unwatchedNetIfs, Lock)},
           .exempt = {{"KARSTResolverCacheCleanup", 1, "the last reference on the cache is gone"},
                      {"KARSTResolverFillQuery", 1, "the first enable, before it subscribes"}}};
 }

@@ -100,17 +100,19 @@ class OurMap {
   };
   static_assert(offsetof(UuidKey, uuid) == offsetof(KARSTRBTreeKey, uuid));
   struct Element {
+    UuidKey key;
     zel_UUID uuid;
     KARSTRBTreeNode node;
     uint32_t number;
-    UuidKey key;
   };
   static const Element &elementOf(const KARSTRBTreeNode *node) {
     return *reinterpret_cast<const Element *>(reinterpret_cast<const char *>(node) -
                                               offsetof(Element, node));
   }
-  void insert(Element &element) { functions_.insert(tree_.get(), &element.node,
-                      reinterpret_cast<KARSTRBTreeKey *>(&element.key), 0); }
+  void insert(Element &element) {
+    functions_.insert(tree_.get(), &element.node, reinterpret_cast<KARSTRBTreeKey *>(&element.key),
+                      0);
+  }
   static constexpr KARSTMemPool pool = {
       [](void *, uint64_t size) { return std::malloc(size); },
       [](void *, uint32_t count, uint32_t size) { return std::calloc(count, size); },
@@ -186,7 +188,7 @@ class IntrusiveSet {
     set_.insert(elements_[number]);
   }
 
- private:
+ protected:
   struct Element : boost::intrusive::set_base_hook<
                        boost::intrusive::link_mode<boost::intrusive::normal_link>> {
     Words words;
@@ -199,6 +201,30 @@ class IntrusiveSet {
 
   std::vector<Element> elements_;
   boost::intrusive::set<Element, boost::intrusive::key_of_value<WordsOf>> set_;
+};
+
+/* The same with a call for each step, as a map of another module's is used: what a map in a library
+ * cannot do without. */
+class CalledSet : public IntrusiveSet {
+ public:
+  using IntrusiveSet::IntrusiveSet;
+  uint64_t iterate() const {
+    uint64_t sum = 0;
+    for (auto at = set_.begin(); at != set_.end(); at = next(at)) sum += at->number;
+    return sum;
+  }
+  void takeOutAndIn(size_t number) {
+    takeOut(elements_[number]);
+    putIn(elements_[number]);
+  }
+
+ private:
+  using Place = decltype(set_)::const_iterator;
+  __attribute__((noinline)) static Place next(Place at) { return ++at; }
+  __attribute__((noinline)) void takeOut(const Element &element) {
+    set_.erase(set_.iterator_to(element));
+  }
+  __attribute__((noinline)) void putIn(Element &element) { set_.insert(element); }
 };
 
 struct BsdElement {

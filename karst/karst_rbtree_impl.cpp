@@ -433,10 +433,9 @@ KARSTRBTreeNode *KARSTRBTree_Insert(KARSTRBTree *tree, KARSTRBTreeKey *key, uint
   return PREF_InsertEx(tree, nullptr, key, value);
 }
 
-KARSTRBTreeNode *KARSTRBTree_InsertNoAlloc(KARSTRBTree *tree, KARSTRBTreeNode *node,
-                                           KARSTRBTreeKey *key, uint32_t value) {
-  return PREF_InsertEx(tree, node, key, value);
-}
+/* The same function by another name: a caller that gives a node has no call more. */
+__attribute__((alias("PREF_InsertEx"))) KARSTRBTreeNode *KARSTRBTree_InsertNoAlloc(
+    KARSTRBTree *tree, KARSTRBTreeNode *node, KARSTRBTreeKey *key, uint32_t value);
 
 /* ---- Lookup and iteration -------------------------------------------------------------------- */
 
@@ -512,7 +511,9 @@ void KARSTRBTree_Remove(KARSTRBTree *tree, KARSTRBTreeNode *node) {
   uint64_t *root = &tree->data->root;
   uint64_t link = LinkTo(links, node);
   uint64_t leaver = link;
-  if (node->left != links.nil && node->right != links.nil) leaver = RbtTreeSuccessor(links, link);
+  if (node->left != links.nil && node->right != links.nil) {
+    leaver = RbtTreeSuccessor(links, link);
+  }
   uint64_t orphan = Child(links, leaver, LEFT);
   if (orphan == links.nil) orphan = Child(links, leaver, RIGHT);
   uint64_t parent = Parent(links, leaver);

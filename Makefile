@@ -5,7 +5,7 @@ SIM_STEPS ?= 600e6
 SIM_PLAIN_STEPS ?= 60e6
 
 .DEFAULT_GOAL := help
-.PHONY: help run build test check sim mutants fuzz coverage format bench clean
+.PHONY: help run build test check sim mutants fuzz coverage format bench counts clean
 
 help: ## show this list
 	@awk -F ':.*## ' '/^[a-z]+:.*## /{printf "  make %-8s %s\n", $$1, $$2}' Makefile
@@ -58,6 +58,10 @@ bench: ## measure the hot paths beside their peers
 	cmake --preset bench >/dev/null
 	cmake --build --preset bench -j $(JOBS)
 	build/bench/bench/karst-bench
+
+counts: ## count the instructions of the hot paths, and compare them with the recorded counts
+	tools/install-deps build test counts
+	tools/check-counts
 
 clean: ## remove everything that was built
 	rm -rf build

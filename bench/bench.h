@@ -4,14 +4,13 @@
 
 #include <benchmark/benchmark.h>
 
-#include <chrono>
 #include <cstdint>
 #include <string>
 #include <vector>
 
-namespace bench {
+#include "bench/clock.h"
 
-using Clock = std::chrono::steady_clock;
+namespace bench {
 
 inline const std::string OURS = "ours";
 

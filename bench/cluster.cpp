@@ -57,7 +57,7 @@ host::Entry healthEntry(uint8_t node, uint8_t interface) {
           host::encode(KarstHealthStatusEntry{})};
 }
 
-Cluster::Cluster()
+Cluster::Cluster(uint8_t nodes)
     : kernel(settings()),
       /* room for the instances of the largest node */
       module(kernel.modules().load(KARST_RESOLVER_SO, {"KARST_RESOLVER_LEAST_MAX_HEAP=0x8000000"})),
@@ -68,7 +68,7 @@ Cluster::Cluster()
           inModule<decltype(KARSTResolver_GetNodeLocators)>("KARSTResolver_GetNodeLocators")) {
   host::Directory &directory = kernel.directory();
   directory.setSelf(nodeUUID(0));
-  for (uint8_t node = 0; node < NODES; node++) {
+  for (uint8_t node = 0; node < nodes; node++) {
     directory.put(nodeEntry(node));
     for (uint8_t interface = 0; interface < INTERFACES_OF_A_NODE; interface++) {
       directory.put(interfaceEntry(node, interface, 0));

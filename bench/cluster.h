@@ -7,7 +7,7 @@
 #include <string>
 #include <vector>
 
-#include "bench/bench.h"
+#include "bench/clock.h"
 #include "host/host_kernel.h"
 #include "host/kernel/heap.h"
 #include "karst_resolver/karst_resolver.h"
@@ -23,7 +23,7 @@ host::Entry interfaceEntry(uint8_t node, uint8_t interface, uint8_t version); /*
 host::Entry healthEntry(uint8_t node, uint8_t interface);
 
 struct Cluster {
-  Cluster(); /* throws host::ModuleError */
+  explicit Cluster(uint8_t nodes = NODES); /* throws host::ModuleError */
 
   /* Blocks that the module has ever asked its heap for. */
   uint64_t allocations() const { return heap().allocations; }

@@ -1,6 +1,7 @@
 /* What karst-bench measures, a file each: registers its subjects and what is asked of them. */
 #pragma once
 
+#include "bench/bench.h"
 #include "bench/cluster.h"
 
 namespace bench {

@@ -12,8 +12,7 @@
  *
  * No locking: whoever owns a tree serialises every use of it, lookups included. No recursion. No
  * allocation, except where the caller asks the tree to provide its own node. Nothing is validated.
- * Costs: insertion, lookup, removal and each bound take O(log count) comparisons; a full iteration
- * O(count).
+ * Costs: a function's time is O(1) where its comment says nothing else.
  *
  * Every stored reference is a link: 0 is null, any other value v means the address base + v, where
  * base belongs to the tree's memory pool. Arguments and results are plain addresses. Nothing that a
@@ -144,7 +143,7 @@ uint8_t KARSTRBTree_CreateTreeData(KARSTRBTree *tree, KARSTRBTreeNode *nil);
 KARSTRBTree *KARSTRBTree_AllocTree(void);
 
 /* Removes every node, then gives back what the tree owns. Null is accepted. A tree object of the
- * caller's keeps a stale `data`. */
+ * caller's keeps a stale `data`. Time: O(count). */
 void KARSTRBTree_FreeTree(KARSTRBTree *tree);
 
 /* Install a function that removal tells the value of each node; the other kind is taken out. The
@@ -160,34 +159,37 @@ uint32_t KARSTRBTree_GetSize(const KARSTRBTree *tree);
 
 /* Insert behind every node with an equal key. The low 30 bits of `value` are kept. Insert allocates
  * the node and returns null, the tree unchanged, when the pool is exhausted; InsertNoAlloc cannot
- * fail; PREF_InsertEx is either, by whether `node` is null. */
+ * fail; PREF_InsertEx is either, by whether `node` is null. Time: O(log count). */
 KARSTRBTreeNode *KARSTRBTree_Insert(KARSTRBTree *tree, KARSTRBTreeKey *key, uint32_t value);
 KARSTRBTreeNode *KARSTRBTree_InsertNoAlloc(KARSTRBTree *tree, KARSTRBTreeNode *node,
                                            KARSTRBTreeKey *key, uint32_t value);
 KARSTRBTreeNode *PREF_InsertEx(KARSTRBTree *tree, KARSTRBTreeNode *node, KARSTRBTreeKey *key,
                                uint32_t value);
 
-/* A node whose key equals the probe (with several, the one met first on the way down), or null. */
+/* A node whose key equals the probe (with several, the one met first on the way down), or null.
+ * Time: O(log count). */
 KARSTRBTreeNode *KARSTRBTree_Find(const KARSTRBTree *tree, const KARSTRBTreeKey *probe);
 
 /* The first node in order whose key is not less than, or is greater than, the probe; or null. One
- * descent and one step for each node that equals the probe. */
+ * descent and one step for each node that equals the probe: O(log count + equal nodes). */
 KARSTRBTreeNode *KARSTRBTree_LowerBound(const KARSTRBTree *tree, const KARSTRBTreeKey *probe);
 KARSTRBTreeNode *KARSTRBTree_UpperBound(const KARSTRBTree *tree, const KARSTRBTreeKey *probe);
 
-/* In order; null before the first and after the last. Prev of null is the last node. */
+/* In order; null before the first and after the last. Prev of null is the last node. Time: O(log
+ * count), O(count) for a full iteration. */
 KARSTRBTreeNode *KARSTRBTree_First(const KARSTRBTree *tree);
 KARSTRBTreeNode *KARSTRBTree_Next(const KARSTRBTree *tree, const KARSTRBTreeNode *node);
 KARSTRBTreeNode *KARSTRBTree_Prev(const KARSTRBTree *tree, const KARSTRBTreeNode *node);
 
 /* Takes exactly this node out: no key, value or other contents move between nodes. A node of the
- * caller's is not cleared and may be inserted again at once. */
+ * caller's is not cleared and may be inserted again at once. Time: O(log count). */
 void KARSTRBTree_Remove(KARSTRBTree *tree, KARSTRBTreeNode *node);
 
-/* Removes `first` and what follows, up to but without `last` (null: to the end). */
+/* Removes `first` and what follows, up to but without `last` (null: to the end). Time: O(log count)
+ * for each. */
 void KARSTRBTree_RemoveRange(KARSTRBTree *tree, KARSTRBTreeNode *first, KARSTRBTreeNode *last);
 
-/* Removes every node, in ascending order. */
+/* Removes every node, in ascending order. Time: O(count). */
 void KARSTRBTree_Clear(KARSTRBTree *tree);
 
 /* Exchanges root, nil and count of two trees; everything else stays with its tree. */

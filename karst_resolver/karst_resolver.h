@@ -78,7 +78,10 @@ typedef struct KARSTResolverInstance KARSTResolverInstance;
  * SetCallback; calls of one instance never overlap. It runs under the instance's spinlock, so it
  * must be short, must not sleep, and must call none of the four functions, for this instance (it
  * would lock against itself) or any other (locks of equal or lower rank would be taken under it).
- * Note that something changed, wake a thread of your own and read the locators there. */
+ * Note that something changed, wake a thread of your own and read the locators there.
+ *
+ * After a change of a node, its instances are called one after the other: time O(interfaces of the
+ * node + its instances), plus what the callbacks take. */
 typedef void (*KARSTResolverCallback)(void *callbackData, KARSTResolverInstance *instance,
                                       uint32_t state);
 
@@ -91,15 +94,18 @@ typedef void (*KARSTResolverCallback)(void *callbackData, KARSTResolverInstance 
  * ZEL_OK, and the instance is resolved; ZEL_BAD_PARAM (no place for the instance, no UUID);
  * ZEL_NOT_INITIALIZED (the resolver is not loaded wholly); ZEL_NO_MEMORY; ZEL_NOT_FOUND (it cannot
  * be resolved at this time); the status of a spinlock or a subscription that could not be made. On
- * a failure nothing is stored and nothing remains. Time: O(log nodes). */
+ * a failure nothing is stored and nothing remains. Time: O(log nodes), however many instances there
+ * are; with an object, plus what the directory takes for a lookup and a subscription. */
 zel_Status KARSTResolver_Create(KARSTResolverInstance **instance, uint32_t entryType,
                                 zel_UUID objectUUID, zel_UUID nodeUUID, bool useLocalLocator);
 
 /* Ends the instance. A callback that runs on another thread is waited for, and none begins after
- * this returned. Time: O(1), plus O(log nodes) when the node goes with its last user. */
+ * this returned. Time: O(1), plus O(log nodes) when the node goes with its last user, plus what the
+ * directory takes to end an object's subscription. */
 void KARSTResolver_Destroy(KARSTResolverInstance *instance);
 
-/* Installs or replaces the callback (null: removes it), then calls it once. Time: O(1). */
+/* Installs or replaces the callback (null: removes it), then calls it once. Time: O(1), plus what the
+ * callback takes. */
 void KARSTResolver_SetCallback(KARSTResolverInstance *instance, KARSTResolverCallback callback,
                                void *callbackData);
 

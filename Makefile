@@ -3,6 +3,7 @@ JOBS ?= $(shell nproc)
 RELEASE := build/release
 SIM_STEPS ?= 600e6
 SIM_PLAIN_STEPS ?= 60e6
+SIM_PREEMPTIONS ?= 3
 
 .DEFAULT_GOAL := help
 .PHONY: help run build test check sim mutants fuzz coverage format bench counts clean
@@ -28,12 +29,14 @@ check: ## format, lint, lock discipline, the module's promises as an object, and
 	tools/install-deps build test check
 	tools/check
 
-sim: ## search schedules and failures, SIM_STEPS (600e6) of them with every access watched
+sim: ## search schedules and failures: SIM_STEPS (600e6) watched, then plain, then all of one window
 	tools/install-deps build test
 	cmake --preset tests >/dev/null
 	cmake --build --preset tests -j $(JOBS) --target karst-sim karst_resolver karst_resolver_watched
 	$(RELEASE)/karst-sim --watched --steps $(SIM_STEPS)
 	$(RELEASE)/karst-sim --plain --steps $(SIM_PLAIN_STEPS)
+	$(RELEASE)/karst-sim --plain --steps 1e9 --scenario small-destroy \
+	  --strategy exhaustive:$(SIM_PREEMPTIONS)
 
 mutants: ## plant faults one by one; each must be found
 	tools/install-deps build test

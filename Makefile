@@ -1,15 +1,17 @@
 # What people type; CMake presets do the work (CMakePresets.json).
 JOBS ?= $(shell nproc)
 RELEASE := build/release
+BENCH := build/bench/bench
 SIM_STEPS ?= 600e6
 SIM_PLAIN_STEPS ?= 60e6
 SIM_PREEMPTIONS ?= 3
 
 .DEFAULT_GOAL := help
-.PHONY: help run build test check sim mutants fuzz coverage format bench counts clean
+.PHONY: help run build test check sim mutants fuzz coverage format bench bench-build bench-full \
+        counts clean
 
 help: ## show this list
-	@awk -F ':.*## ' '/^[a-z]+:.*## /{printf "  make %-8s %s\n", $$1, $$2}' Makefile
+	@awk -F ':.*## ' '/^[a-z-]+:.*## /{printf "  make %-10s %s\n", $$1, $$2}' Makefile
 
 run: build ## install what is needed, build, and watch a small cluster change
 	examples/demo $(RELEASE)/karst examples/cluster.json
@@ -56,11 +58,22 @@ format: ## lay the sources out as .clang-format says
 	tools/install-deps check
 	git ls-files '*.h' '*.c' '*.cpp' | xargs clang-format -i
 
-bench: ## measure the hot paths beside their peers
+bench-build:
 	tools/install-deps build bench
 	cmake --preset bench >/dev/null
 	cmake --build --preset bench -j $(JOBS)
-	build/bench/bench/karst-bench
+
+bench: bench-build ## measure the hot paths beside their peers, and plot: build/bench/plots
+	$(BENCH)/karst-bench --json=build/bench/bench.json
+	tools/plot-bench --into=build/bench/plots --bench=build/bench/bench.json
+
+bench-full: bench-build ## the same with more repetitions, and how cost grows: docs/performance
+	mkdir -p docs/performance
+	$(BENCH)/karst-bench --json=docs/performance/bench.json \
+	  --benchmark_repetitions=31 --benchmark_min_time=0.05
+	$(BENCH)/karst-growth --json=docs/performance/growth.json
+	tools/plot-bench --into=docs/performance --bench=docs/performance/bench.json \
+	  --growth=docs/performance/growth.json
 
 counts: ## count the instructions of the hot paths, and compare them with the recorded counts
 	tools/install-deps build test counts

@@ -31,7 +31,7 @@ check: ## format, lint, lock discipline, the module's promises as an object, and
 	tools/install-deps build test check
 	tools/check
 
-sim: ## search schedules and failures: SIM_STEPS (600e6) watched, then plain, then all of one window
+sim: ## search schedules and failures: SIM_STEPS (600e6) watched, then plain
 	tools/install-deps build test
 	cmake --preset tests >/dev/null
 	cmake --build --preset tests -j $(JOBS) --target karst-sim karst_resolver karst_resolver_watched

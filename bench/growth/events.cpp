@@ -6,6 +6,7 @@
 #include <cstring>
 #include <stdexcept>
 
+#include "bench/bench.h"
 #include "bench/growth/series.h"
 #include "bench/growth/watched.h"
 

@@ -4,6 +4,7 @@
 #include <barrier>
 #include <thread>
 
+#include "bench/bench.h"
 #include "bench/growth/series.h"
 #include "bench/growth/watched.h"
 

@@ -1,6 +1,7 @@
 /* How cost grows with the cluster, nodes and interfaces, and with the instances of its clients. */
 #include <stdexcept>
 
+#include "bench/bench.h"
 #include "bench/growth/series.h"
 #include "bench/growth/watched.h"
 #include "karst_resolver/model.h"

@@ -75,8 +75,14 @@ std::optional<Key> keyOf(const KarstQuery &query) {
   return Key{query.type, all ? zel_UUID{} : query.uuid};
 }
 
+/* An entry and its header, which is made once for all that are told of it or look it up. */
+struct KeptEntry : Entry {
+  explicit KeptEntry(Entry entry) : Entry(std::move(entry)), header(headerOf(*this)) {}
+  KarstEntryHeader header;
+};
+
 using SharedEntry =
-    std::shared_ptr<const Entry>; /* never changed, so it is read without the lock */
+    std::shared_ptr<const KeptEntry>; /* never changed, so it is read without the lock */
 using Entries = std::map<Key, SharedEntry>;
 
 /* The first entry that the key asks for, or the end. */
@@ -102,10 +108,9 @@ zel_Status copyWhole(const SharedEntry &entry, const ExprMshAllocator &allocator
   const size_t length = entry->data.size();
   void *block = allocator.alloc(allocator.context, sizeof(KarstFullEntry) + length);
   if (block == nullptr) return ZEL_NO_MEMORY;
-  const KarstEntryHeader header = headerOf(*entry);
-  std::memcpy(block, &header, sizeof header);
+  std::memcpy(block, &entry->header, sizeof entry->header);
   if (length != 0) {
-    std::memcpy(static_cast<uint8_t *>(block) + sizeof header, entry->data.data(), length);
+    std::memcpy(static_cast<uint8_t *>(block) + sizeof entry->header, entry->data.data(), length);
   }
   *result = static_cast<KarstFullEntry *>(block);
   return ZEL_OK;
@@ -126,7 +131,7 @@ struct Directory::Impl {
   Entries::const_iterator find(const Key &key) const;
   void tell(const std::shared_ptr<Subscription> &subscription, const KarstEntryHeader &header,
             zel_Status status);
-  void tellMatching(const Entry &entry, zel_Status status);
+  void tellMatching(const KeptEntry &entry, zel_Status status);
   void tellMissed(Subscription &subscription, const Key &key) const;
   void tellResync();
   void settle();
@@ -186,11 +191,10 @@ void Directory::Impl::tell(const std::shared_ptr<Subscription> &subscription,
   delivery.schedule(subscription);
 }
 
-void Directory::Impl::tellMatching(const Entry &entry, zel_Status status) {
-  const KarstEntryHeader header = headerOf(entry);
+void Directory::Impl::tellMatching(const KeptEntry &entry, zel_Status status) {
   const auto tellAll = [&](const Key &key) {
     const auto [first, last] = installed.equal_range(key);
-    for (auto it = first; it != last; ++it) tell(it->second, header, status);
+    for (auto it = first; it != last; ++it) tell(it->second, entry.header, status);
   };
   tellAll({entry.type, zel_UUID{}});
   if (!isZero(entry.uuid)) tellAll({entry.type, entry.uuid});
@@ -203,9 +207,8 @@ void Directory::Impl::tellMissed(Subscription &subscription, const Key &key) con
   if (!interrupted || !isZero(key.uuid)) return;
   for (auto it = firstMatch(missed, key); it != missed.end();
        it = nextMatch(missed, key, it->first, it)) {
-    const KarstEntryHeader header = headerOf(*it->second);
-    subscription.tellAtStart(header, ZEL_OK);
-    subscription.tellAtStart(header, ZEL_NOT_FOUND);
+    subscription.tellAtStart(it->second->header, ZEL_OK);
+    subscription.tellAtStart(it->second->header, ZEL_NOT_FOUND);
   }
 }
 
@@ -309,7 +312,7 @@ void Directory::deregisterStatus(KarstStatusFn fn, void *data) {
 /* ---- Changes --------------------------------------------------------------------------------- */
 
 void Directory::put(Entry entry) {
-  const auto present = std::make_shared<const Entry>(std::move(entry));
+  const auto present = std::make_shared<const KeptEntry>(std::move(entry));
   const Announcing announcing(impl_->mutex, impl_->delivery);
   const Key key{present->type, present->uuid};
   impl_->missed.erase(key);
@@ -354,7 +357,7 @@ zel_Status Directory::subscribe(const KarstQuery *query, KarstSubscriptionFn fn,
   impl_->tellMissed(*subscription, *key);
   for (auto it = firstMatch(impl_->entries, *key); it != impl_->entries.end();
        it = nextMatch(impl_->entries, *key, it->first, it)) {
-    subscription->tellAtStart(headerOf(*it->second), ZEL_OK);
+    subscription->tellAtStart(it->second->header, ZEL_OK);
   }
   /* Who looked one entry up before it subscribed may have found what is gone by now. */
   if (!isZero(key->uuid) && impl_->entries.count(*key) == 0) {
@@ -392,7 +395,7 @@ zel_Status Directory::findEntry(const KarstQuery &query, uint32_t next,
                                : firstMatch(impl_->entries, *key);
   impl_->walked = found;
   if (found == impl_->entries.end()) return ZEL_NOT_FOUND;
-  *header = headerOf(*found->second);
+  *header = found->second->header;
   return ZEL_OK;
 }
 

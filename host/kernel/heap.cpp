@@ -8,9 +8,9 @@
 #include <cinttypes>
 #include <cstdlib>
 #include <limits>
+#include <map>
 #include <memory>
 #include <mutex>
-#include <unordered_map>
 
 #include "host/kernel/log.h"
 #include "host/kernel/module_loader.h"
@@ -128,8 +128,8 @@ std::mutex heapsLock;
 HeapMemory *heapMemory = nullptr;    /* of heaps to come; null: malloc */
 zel_HeapID lastHeapID = ZEL_NO_HEAP; /* IDs are never used twice: a stale one is recognised */
 
-std::unordered_map<zel_HeapID, std::unique_ptr<Heap>> &heaps() {
-  static std::unordered_map<zel_HeapID, std::unique_ptr<Heap>> table;
+std::map<zel_HeapID, std::unique_ptr<Heap>> &heaps() {
+  static std::map<zel_HeapID, std::unique_ptr<Heap>> table;
   return table;
 }
 
@@ -238,7 +238,6 @@ std::vector<zel_HeapID> heapsAlive() {
   std::vector<zel_HeapID> alive;
   const std::lock_guard guard(heapsLock);
   for (const auto &[id, heap] : heaps()) alive.push_back(id);
-  std::sort(alive.begin(), alive.end());
   return alive;
 }
 

@@ -69,8 +69,7 @@ bench: bench-build ## measure the hot paths beside their peers, and plot: build/
 
 bench-full: bench-build ## the same with more repetitions, and how cost grows: docs/performance
 	mkdir -p docs/performance
-	$(BENCH)/karst-bench --json=docs/performance/bench.json \
-	  --benchmark_repetitions=31 --benchmark_min_time=0.05
+	$(BENCH)/karst-bench --json=docs/performance/bench.json --benchmark_repetitions=31
 	$(BENCH)/karst-growth --json=docs/performance/growth.json
 	tools/plot-bench --into=docs/performance --bench=docs/performance/bench.json \
 	  --growth=docs/performance/growth.json

@@ -6,6 +6,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdio>
 #include <filesystem>
 #include <stdexcept>
 
@@ -68,6 +69,20 @@ Registry &registry() {
 std::string nameOf(const Subject &subject) {
   registry().subjects.push_back(subject);
   return subject.work + SEPARATOR + subject.who;
+}
+
+void showProgress(const benchmark::State &state) {
+  static const bool wanted = isatty(STDERR_FILENO) != 0;
+  static const Clock::time_point start = Clock::now();
+  static Clock::time_point shown = start;
+  static size_t runs = 0;
+  if (!wanted || state.thread_index() != 0) return;
+  runs++;
+  const Clock::time_point now = Clock::now();
+  if (now - shown < std::chrono::seconds(1)) return;
+  shown = now;
+  std::fprintf(stderr, "\r%zu runs of %zu subjects in %.0f s ", runs, registry().subjects.size(),
+               std::chrono::duration<double>(now - start).count());
 }
 
 Subject subjectOf(const std::string &name) {

@@ -25,11 +25,17 @@ struct Subject {
 /* As the benchmark library knows the subject; remembers its place in the order of the table. */
 std::string nameOf(const Subject &subject);
 
+/* On a terminal, once a second: how many runs there have been, and for how long. */
+void showProgress(const benchmark::State &state);
+
 /* Function takes a benchmark::State. All subjects run in one process, their repetitions in random
  * order, so that what disturbs the machine disturbs all of them. */
 template <typename Function>
 benchmark::internal::Benchmark *measure(const Subject &subject, Function function) {
-  return benchmark::RegisterBenchmark(nameOf(subject).c_str(), function);
+  return benchmark::RegisterBenchmark(nameOf(subject).c_str(), [=](benchmark::State &state) {
+    showProgress(state);
+    function(state);
+  });
 }
 
 /* The name of a subject that is no peer but the least that the machine allows. */

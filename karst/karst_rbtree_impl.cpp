@@ -420,6 +420,7 @@ KARSTRBTreeNode *PREF_InsertEx(KARSTRBTree *tree, KARSTRBTreeNode *node, KARSTRB
     node->parent = links.nil;
     *root = link;
   } else {
+    /* NOLINTNEXTLINE(clang-analyzer-core.NullDereference): the tree's second node has a key */
     node->parent = key->kind == KARSTRBTREE_KEY_UUID ? PlaceForUuid(links, *root, key->uuid, &side)
                                                      : PlaceForAny(links, *root, key, &side);
     SetChild(links, node->parent, side, link);

@@ -291,6 +291,41 @@ TEST_F(Worlds, LoseNoWakeUpThatRacesTheWait) {
 
 /* The world never sleeps, so the stop finds it running; a stop outlives the wait that reports it,
  * and a wake-up does not hide it. */
+/* Put off, a wake-up is made at the end, when another world is woken, or when the thread blocks; never
+ * lost, which this test would wait for in vain. */
+TEST_F(Worlds, GetWakeUpsThatWerePutOff) {
+  std::counting_semaphore<> woken(0);
+  std::atomic<int> times{0};
+  Body body = [&] {
+    while (wait() == ZEL_OK) {
+      ++times;
+      woken.release();
+    }
+  };
+  zel_WorldID one = start("one", body);
+  zel_WorldID other = start("other", body);
+  host::waitUntilWorldsIdle();
+  {
+    const host::WakeUpsPutOff putOff;
+    zel_WorldForceWakeup(one);
+    EXPECT_EQ(times, 0);
+  }
+  woken.acquire();
+  host::waitUntilWorldsIdle();
+  {
+    const host::WakeUpsPutOff putOff;
+    zel_WorldForceWakeup(one);
+    zel_WorldForceWakeup(other);
+    woken.acquire(); /* the first of them */
+    zel_WorldSleep(0);
+    woken.acquire();
+  }
+  host::waitUntilWorldsIdle();
+  EXPECT_EQ(times, 3);
+  TOLM_WorldDestroy(&one);
+  TOLM_WorldDestroy(&other);
+}
+
 TEST_F(Worlds, StopAtEveryWaitAfterTheStop) {
   std::latch timedOut(1);
   zel_Status later = ZEL_OK;

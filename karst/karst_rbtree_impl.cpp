@@ -114,8 +114,19 @@ void Rotate(Links links, uint64_t *root, uint64_t link, Side side) {
   SetParent(links, link, riser);
 }
 
+void RbtLeftRotate(Links links, uint64_t *root, uint64_t link) {
+  Rotate(links, root, link, LEFT);
+}
+void RbtRightRotate(Links links, uint64_t *root, uint64_t link) {
+  Rotate(links, root, link, RIGHT);
+}
+
 void RotateTowards(Links links, uint64_t *root, uint64_t link, Side side) {
-  Rotate(links, root, link, side);
+  if (side == LEFT) {
+    RbtLeftRotate(links, root, link);
+  } else {
+    RbtRightRotate(links, root, link);
+  }
 }
 
 /* The last node from this one, which is not the nil, down along one side. */

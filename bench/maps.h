@@ -31,14 +31,10 @@ inline Words wordsOf(const zel_UUID &uuid) {
   return {KARSTRBTreeWord(uuid.bytes), KARSTRBTreeWord(uuid.bytes + 8)};
 }
 
-/* By node handles: like ours, without allocating. */
-class StdMap {
+/* From a key's words to its number; what the two maps of this kind look alike in. */
+template <typename Map>
+class NumberByWords {
  public:
-  explicit StdMap(const std::vector<zel_UUID> &keys) : outside_(keys.size()) {
-    for (const zel_UUID &uuid : keys) {
-      places_.push_back(map_.emplace(wordsOf(uuid), places_.size()).first);
-    }
-  }
   const uint32_t *find(const zel_UUID &uuid) const {
     const auto found = map_.find(wordsOf(uuid));
     return found == map_.end() ? nullptr : &found->second;
@@ -47,6 +43,19 @@ class StdMap {
     uint64_t sum = 0;
     for (const auto &[words, number] : map_) sum += number;
     return sum;
+  }
+
+ protected:
+  Map map_;
+};
+
+/* By node handles: like ours, without allocating. */
+class StdMap : public NumberByWords<std::map<Words, uint32_t>> {
+ public:
+  explicit StdMap(const std::vector<zel_UUID> &keys) : outside_(keys.size()) {
+    for (const zel_UUID &uuid : keys) {
+      places_.push_back(map_.emplace(wordsOf(uuid), places_.size()).first);
+    }
   }
   void insertAll() {
     for (size_t i = 0; i < outside_.size(); i++) {
@@ -61,7 +70,6 @@ class StdMap {
   }
 
  private:
-  std::map<Words, uint32_t> map_;
   std::vector<std::map<Words, uint32_t>::iterator> places_;
   std::vector<std::map<Words, uint32_t>::node_type> outside_;
 };
@@ -189,20 +197,11 @@ class BsdMap {
 };
 
 /* Its elements move: no node to keep, and it allocates. */
-class BTree {
+class BTree : public NumberByWords<absl::btree_map<Words, uint32_t>> {
  public:
   explicit BTree(const std::vector<zel_UUID> &keys) {
     for (const zel_UUID &uuid : keys) keys_.push_back(wordsOf(uuid));
     insertAll();
-  }
-  const uint32_t *find(const zel_UUID &uuid) const {
-    const auto found = map_.find(wordsOf(uuid));
-    return found == map_.end() ? nullptr : &found->second;
-  }
-  uint64_t iterate() const {
-    uint64_t sum = 0;
-    for (const auto &[words, number] : map_) sum += number;
-    return sum;
   }
   void insertAll() {
     for (size_t i = 0; i < keys_.size(); i++) insert(i);
@@ -219,7 +218,6 @@ class BTree {
   void insert(size_t number) { map_.emplace(keys_[number], static_cast<uint32_t>(number)); }
 
   std::vector<Words> keys_;
-  absl::btree_map<Words, uint32_t> map_;
 };
 
 }  // namespace bench

@@ -46,7 +46,9 @@ static __attribute__((noinline)) void KARSTResolverTraceWrite(TraceStream *strea
   uint64_t word1 = __atomic_load_n(&record->word1, __ATOMIC_RELAXED);
   KARSTResolverTraceSetBits(&record->word1, &word1, 35, 29, sequence);
   KARSTResolverTraceSetBits(&record->word0, &word0, 1, 8, processor);
-  KARSTResolverTraceSetBits(&record->word1, &word1, 0, 35, kind); /* neighbours: at once */
+  KARSTResolverTraceSetBits(&record->word1, &word1, 0, 6, kind); /* type, id and site number */
+  KARSTResolverTraceSetBits(&record->word1, &word1, 6, 14, kind >> 6);
+  KARSTResolverTraceSetBits(&record->word1, &word1, 20, 15, kind >> 20);
   KARSTResolverTraceSetBits(&record->word0, &word0, 9, 55, nanoseconds);
   __atomic_store_n(&record->payload[0], payload[0], __ATOMIC_RELAXED);
   __atomic_store_n(&record->payload[1], payload[1], __ATOMIC_RELAXED);

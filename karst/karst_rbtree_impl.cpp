@@ -210,7 +210,7 @@ void RemoveFixUp(Links links, uint64_t *root, uint64_t link) {
     }
     uint64_t nearChild = Child(links, sibling, side);
     uint64_t farChild = Child(links, sibling, Opposite(side));
-    if (!IsRed(links, nearChild) && !IsRed(links, farChild)) {
+    if (!(IsRed(links, nearChild) | IsRed(links, farChild))) {
       SetRed(links, sibling);
       link = parent;
       continue;
@@ -233,24 +233,24 @@ void RemoveFixUp(Links links, uint64_t *root, uint64_t link) {
 
 /* ---- Descents -------------------------------------------------------------------------------- */
 
-/* A UUID's two words as one number: two instructions compare it. */
-typedef unsigned __int128 Words;
-
-Words WordsOf(const void *uuid) {
-  return (Words)KARSTRBTreeWord(uuid) << 64 | KARSTRBTreeWord((const uint8_t *)uuid + 8);
-}
-
-/* The words of a node's UUID. To them leads a chain of two loads, by the key record, while in
- * structures that embed node and UUID the one lies at the same distance from the other in all of them.
- * So that distance is guessed to be the last one's, and `guessed` (distance plus base) is where the
- * words are read unless the chain ends elsewhere. That is checked by a branch which the processor
- * foresees, and so it does not wait for the chain before it goes on: value speculation. */
-Words NodeWords(Links links, uint64_t link, uint64_t *guessed) {
+/* To a node's UUID leads a chain of two loads, by the key record, while in structures that embed node
+ * and UUID the one lies at the same distance from the other in all of them. So that distance is guessed
+ * to be the last one's, and `guessed` (distance plus base) is where the UUID is read unless the chain
+ * ends elsewhere. That is checked by a branch which the processor foresees, and so it does not wait for
+ * the chain before it goes on: value speculation. */
+const uint8_t *NodeUuid(Links links, uint64_t link, uint64_t *guessed) {
   uint64_t uuid = (uint64_t)KeyOf(links, link)->uuid;
   uint64_t guess = *guessed + link;
   asm("" : "+r"(guess)); /* else the compiler, knowing the two equal, would read by the chain */
   if (__builtin_expect(guess != uuid, 0)) *guessed = uuid - link;
-  return WordsOf((const void *)(*guessed + link));
+  return (const uint8_t *)(*guessed + link);
+}
+
+/* Are the first words of two UUIDs the same? Rarely, and then the second ones decide. Asked apart from
+ * which is the less, or the compiler would make one branch of both, and no conditional move. */
+bool RarelyEqual(uint64_t word, uint64_t other) {
+  asm("" : "+r"(word));
+  return __builtin_expect(word == other, 0);
 }
 
 /* The child on the side of the probe. As likely one as the other: a conditional move, not a branch,
@@ -262,12 +262,19 @@ uint64_t ChildTowards(Links links, uint64_t link, bool less) {
 }
 
 uint64_t FindUuid(Links links, uint64_t link, const zel_UUID *uuid) {
-  Words probe = WordsOf(uuid->bytes);
+  uint64_t first = KARSTRBTreeWord(uuid->bytes);
+  uint64_t second = KARSTRBTreeWord(uuid->bytes + 8);
   uint64_t guessed = links.base;
   while (link != links.nil) {
-    Words words = NodeWords(links, link, &guessed);
-    if (__builtin_expect(words == probe, 0)) break;
-    link = ChildTowards(links, link, probe < words);
+    const uint8_t *words = NodeUuid(links, link, &guessed);
+    uint64_t nodeFirst = KARSTRBTreeWord(words);
+    uint64_t child = ChildTowards(links, link, first < nodeFirst);
+    if (RarelyEqual(nodeFirst, first)) {
+      uint64_t nodeSecond = KARSTRBTreeWord(words + 8);
+      if (second == nodeSecond) break;
+      child = ChildTowards(links, link, second < nodeSecond);
+    }
+    link = child;
   }
   return link;
 }
@@ -281,30 +288,39 @@ uint64_t FindAny(Links links, uint64_t link, const KARSTRBTreeKey *probe) {
   return link;
 }
 
-/* Where a new key comes to hang: its parent, or the nil in an empty tree, and the side there. Behind
- * what it equals. */
+/* Where a new key comes to hang, behind what it equals: its parent, and the side there. The tree is not
+ * empty. */
 uint64_t PlaceForUuid(Links links, uint64_t root, const zel_UUID *uuid, Side *side) {
-  Words key = WordsOf(uuid->bytes);
+  uint64_t first = KARSTRBTreeWord(uuid->bytes);
+  uint64_t second = KARSTRBTreeWord(uuid->bytes + 8);
   uint64_t guessed = links.base;
-  uint64_t parent = links.nil;
-  bool less = true;
-  for (uint64_t next = root; next != links.nil; next = ChildTowards(links, next, less)) {
-    parent = next;
-    less = key < NodeWords(links, next, &guessed);
+  for (uint64_t parent = root;;) {
+    const uint8_t *words = NodeUuid(links, parent, &guessed);
+    uint64_t parentFirst = KARSTRBTreeWord(words);
+    bool less = first < parentFirst;
+    uint64_t child = ChildTowards(links, parent, less);
+    if (RarelyEqual(parentFirst, first)) {
+      less = second < KARSTRBTreeWord(words + 8);
+      child = ChildTowards(links, parent, less);
+    }
+    if (child == links.nil) {
+      *side = (Side)!less;
+      return parent;
+    }
+    parent = child;
   }
-  *side = (Side)!less;
-  return parent;
 }
 
 uint64_t PlaceForAny(Links links, uint64_t root, const KARSTRBTreeKey *key, Side *side) {
-  uint64_t parent = links.nil;
-  bool less = true;
-  for (uint64_t next = root; next != links.nil; next = ChildTowards(links, next, less)) {
-    parent = next;
-    less = KARSTRBTreeCompare(key, KeyOf(links, next)) < 0;
+  for (uint64_t parent = root;;) {
+    bool less = KARSTRBTreeCompare(key, KeyOf(links, parent)) < 0;
+    uint64_t child = ChildTowards(links, parent, less);
+    if (child == links.nil) {
+      *side = (Side)!less;
+      return parent;
+    }
+    parent = child;
   }
-  *side = (Side)!less;
-  return parent;
 }
 
 /* The descent of both bounds: stops at an equal node, or where the probe would hang. *order tells
@@ -518,20 +534,26 @@ void KARSTRBTree_Remove(KARSTRBTree *tree, KARSTRBTreeNode *node) {
   }
 
   /* `leaver` gives up its position: the node itself, or its successor, which has no left child and
-   * then takes the node's place as a whole. */
+   * then takes the node's place as a whole. `orphan` is its only possible child. Which node has which
+   * children and colours is anybody's guess, so few branches ask for it. */
   Links links = LinksOf(tree);
   uint64_t *root = &tree->data->root;
   uint64_t link = LinkTo(links, node);
   uint64_t leaver = link;
   if (node->left != links.nil && node->right != links.nil) {
-    leaver = RbtTreeSuccessor(links, link);
+    leaver = Outermost(links, node->right, LEFT);
   }
-  uint64_t orphan = Child(links, leaver, LEFT);
-  if (orphan == links.nil) orphan = Child(links, leaver, RIGHT);
+  uint64_t left = Child(links, leaver, LEFT);
+  uint64_t right = Child(links, leaver, RIGHT);
+  uint64_t orphan = __builtin_expect_with_probability(left == links.nil, 1, 0.5) ? right : left;
   uint64_t parent = Parent(links, leaver);
   SetParent(links, orphan, parent); /* the nil's too: the fix-up climbs from it */
   ReplaceBelow(links, root, parent, leaver, orphan);
-  if (!IsRed(links, leaver)) RemoveFixUp(links, root, orphan);
+  if (IsRed(links, leaver) | IsRed(links, orphan)) { /* a red leaver's orphan is black already */
+    SetBlack(links, orphan);
+  } else {
+    RemoveFixUp(links, root, orphan);
+  }
 
   if (leaver != link) { /* into the node's place as the fix-up has left it */
     KARSTRBTreeNode *successor = At(links, leaver);

@@ -9,6 +9,7 @@
 #include <absl/container/btree_map.h>
 #include <bsd/sys/tree.h>
 
+#include <array>
 #include <boost/intrusive/set.hpp>
 #include <cstdlib>
 #include <map>
@@ -74,9 +75,11 @@ class StdMap : public NumberByWords<std::map<Words, uint32_t>> {
   std::vector<std::map<Words, uint32_t>::node_type> outside_;
 };
 
-class IntrusiveSet {
+/* `Unused` is what an element has more than it needs, between its links and its key. */
+template <typename Unused>
+class IntrusiveSetWith {
  public:
-  explicit IntrusiveSet(const std::vector<zel_UUID> &keys) : elements_(keys.size()) {
+  explicit IntrusiveSetWith(const std::vector<zel_UUID> &keys) : elements_(keys.size()) {
     for (size_t i = 0; i < keys.size(); i++) {
       elements_[i].words = wordsOf(keys[i]);
       elements_[i].number = static_cast<uint32_t>(i);
@@ -106,6 +109,7 @@ class IntrusiveSet {
  protected:
   struct Element : boost::intrusive::set_base_hook<
                        boost::intrusive::link_mode<boost::intrusive::normal_link>> {
+    [[no_unique_address]] Unused unused;
     Words words;
     uint32_t number;
   };
@@ -116,7 +120,17 @@ class IntrusiveSet {
 
   std::vector<Element> elements_;
   boost::intrusive::set<Element, boost::intrusive::key_of_value<WordsOf>> set_;
+
+ public:
+  static constexpr size_t elementSize = sizeof(Element);
 };
+
+struct Nothing {};
+using IntrusiveSet = IntrusiveSetWith<Nothing>;
+
+/* The same with elements of as many bytes as ours: among a million, lines and pages are what counts. */
+using LargerSet = IntrusiveSetWith<std::array<uint64_t, 2>>;
+static_assert(LargerSet::elementSize == OurMap::elementSize);
 
 /* The same with a call for each step, as a map of another module's is used: what a map in a library
  * cannot do without. */

@@ -101,6 +101,9 @@ class OurMap {
   std::vector<Element> elements_;
   const MapFunctions functions_;
   std::unique_ptr<KARSTRBTree, void (*)(KARSTRBTree *)> tree_; /* goes before its nodes */
+
+ public:
+  static constexpr size_t elementSize = sizeof(Element);
 };
 
 }  // namespace bench

@@ -76,41 +76,35 @@ const cbor_callbacks itemCallbacks = [] {
   return callbacks;
 }();
 
-/* Tags and simple values that nobody has assigned are well-formed, yet libcbor refuses them. True
- * when the next item is such a one; then it has been read. */
-bool readUnassigned(ExprMshReader &reader, CborItem *item, zel_Status *status) {
+/* Tags and simple values that nobody has assigned are well-formed, yet libcbor refuses them. Reads the
+ * refused item if it is such a one. */
+zel_Status readUnassigned(ExprMshReader &reader, CborItem *item) {
   constexpr uint8_t firstTag = 0xc6, lastTag = 0xd4, firstSimple = 0xe0, lastSimple = 0xf3;
   constexpr uint8_t simpleInNextByte = 0xf8, leastInNextByte = 32;
   const uint8_t *at = reader.data + reader.position;
-  *status = ZEL_OK;
   if (*at >= firstTag && *at <= lastTag) {
     item->kind = CborKind::Tag;
     reader.position += 1;
-    return true;
+    return ZEL_OK;
   }
   if (*at >= firstSimple && *at <= lastSimple) {
     reader.position += 1;
-    return true;
+    return ZEL_OK;
   }
-  if (*at != simpleInNextByte) return false;
-  if (reader.length - reader.position < 2) {
-    *status = EXPR_MSH_TRUNCATED;
-  } else if (at[1] < leastInNextByte) {
-    *status = EXPR_MSH_MALFORMED;
-  }
+  if (*at != simpleInNextByte) return EXPR_MSH_MALFORMED;
+  if (reader.length - reader.position < 2) return EXPR_MSH_TRUNCATED;
+  if (at[1] < leastInNextByte) return EXPR_MSH_MALFORMED;
   reader.position += 2;
-  return true;
+  return ZEL_OK;
 }
 
 zel_Status readItem(ExprMshReader &reader, CborItem *item) {
   *item = {};
   if (reader.position >= reader.length) return EXPR_MSH_TRUNCATED;
-  zel_Status status = ZEL_OK;
-  if (readUnassigned(reader, item, &status)) return status;
   const cbor_decoder_result result = cbor_stream_decode(
       reader.data + reader.position, reader.length - reader.position, &itemCallbacks, item);
   if (result.status == CBOR_DECODER_NEDATA) return EXPR_MSH_TRUNCATED;
-  if (result.status != CBOR_DECODER_FINISHED) return EXPR_MSH_MALFORMED;
+  if (result.status != CBOR_DECODER_FINISHED) return readUnassigned(reader, item);
   reader.position += result.read;
   return ZEL_OK;
 }

@@ -3,6 +3,7 @@
 
 #include <cstring>
 #include <limits>
+#include <optional>
 #include <string_view>
 
 #include "host/directory/cbor.h"
@@ -15,31 +16,27 @@ constexpr size_t addressSize = 16;
 constexpr size_t macSize = 6;
 constexpr size_t maxRows = 64; /* one bit each says which names were seen */
 
-/* Rows of a table; more than maxRows for one that has no end in reach. */
-size_t rowCount(const ExprMshField *table) {
-  size_t count = 0;
-  while (count <= maxRows && table[count].name != nullptr) ++count;
-  return count;
+bool isUsable(const ExprMshField &row) {
+  switch (row.type) {
+    case EXPR_MSH_U64:
+    case EXPR_MSH_U32:
+    case EXPR_MSH_ADDRESS:
+    case EXPR_MSH_MAC:
+      return true;
+    case EXPR_MSH_NESTED:
+      return row.encode != nullptr && row.decode != nullptr;
+    default:
+      return false;
+  }
 }
 
-bool isUsable(const ExprMshField *table) {
-  const size_t rows = rowCount(table);
-  if (rows > maxRows) return false;
-  for (size_t i = 0; i < rows; ++i) {
-    switch (table[i].type) {
-      case EXPR_MSH_U64:
-      case EXPR_MSH_U32:
-      case EXPR_MSH_ADDRESS:
-      case EXPR_MSH_MAC:
-        break;
-      case EXPR_MSH_NESTED:
-        if (table[i].encode == nullptr || table[i].decode == nullptr) return false;
-        break;
-      default:
-        return false;
-    }
+/* The rows of a table; none for one that has no end in reach, or a row that cannot be used. */
+std::optional<size_t> usableRows(const ExprMshField *table) {
+  for (size_t rows = 0; rows <= maxRows; ++rows) {
+    if (table[rows].name == nullptr) return rows;
+    if (!isUsable(table[rows])) break;
   }
-  return true;
+  return std::nullopt;
 }
 
 template <typename Number>
@@ -134,7 +131,7 @@ zel_Status decodePair(ExprMshReader &reader, const ExprMshField *table, void *re
 }
 
 zel_Status decodeRecord(ExprMshReader &reader, const ExprMshField *table, void *record) {
-  if (!isUsable(table)) return ZEL_BAD_PARAM;
+  if (!usableRows(table)) return ZEL_BAD_PARAM;
   CborContainer map;
   zel_Status status = openMap(reader, &map);
   if (status == EXPR_MSH_BAD_TYPE) return EXPR_MSH_MALFORMED;
@@ -153,10 +150,11 @@ zel_Status decodeRecord(ExprMshReader &reader, const ExprMshField *table, void *
 }  // namespace
 
 zel_Status marshal(const ExprMshField *table, const void *record, std::vector<uint8_t> *out) {
-  if (!isUsable(table)) return ZEL_BAD_PARAM;
+  const std::optional<size_t> rows = usableRows(table);
+  if (!rows) return ZEL_BAD_PARAM;
   const size_t before = out->size();
   ExprMshWriter writer{out};
-  writeMapStart(writer, rowCount(table));
+  writeMapStart(writer, *rows);
   for (const ExprMshField *row = table; row->name != nullptr; ++row) {
     writeName(writer, row->name);
     const zel_Status status = encodeField(writer, *row, record);

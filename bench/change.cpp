@@ -14,6 +14,7 @@
 #include <thread>
 
 #include "bench/subjects.h"
+#include "host/directory/records.h"
 
 namespace bench {
 namespace {
@@ -78,10 +79,12 @@ class Stage {
   std::thread thread_{[this] { run(); }};
 };
 
-/* As many hand-offs as a change takes, with nothing to do in between. */
+/* As many hand-offs as a change takes, with nothing to do in between but `between`. */
 class HandOffs {
  public:
-  HandOffs() { settle(); }
+  explicit HandOffs(std::function<void()> between = [] {}) : between_(std::move(between)) {
+    settle();
+  }
   void put(bool measured) { first_.put(measured); }
   void settle() {
     first_.settle();
@@ -90,11 +93,15 @@ class HandOffs {
   Clock::time_point lastCall() const { return called_; }
 
  private:
+  const std::function<void()> between_;
   std::atomic<Clock::time_point> called_{};
   Stage second_{[this](bool measured) {
     if (measured) called_ = Clock::now();
   }};
-  Stage first_{[this](bool measured) { second_.put(measured); }};
+  Stage first_{[this](bool measured) {
+    between_();
+    second_.put(measured);
+  }};
 };
 
 /* ---- A stream of other changes --------------------------------------------------------------- */
@@ -246,11 +253,20 @@ void burst(benchmark::State &state, Cluster &cluster, WatchedNode &node, Watched
   }
 }
 
+/* What cannot be left out between the hand-offs: the entry is read and decoded. */
+void readEntry(Cluster &cluster) {
+  KarstNetInterfaceEntry record;
+  const auto entry =
+      cluster.kernel.directory().entry(KARST_TYPE_NET_INTERFACE, interfaceUUID(LATENCY_NODE, 0));
+  if (!entry || host::decode(entry->data, &record) != ZEL_OK) std::abort();
+  benchmark::DoNotOptimize(record);
+}
+
 /* The client is on processor 0, what serves it on one or the other, a stream on the client's. */
 void measureLatency(Cluster &cluster, const std::string &where, unsigned processor,
                     const std::shared_ptr<WatchedNode> &node,
                     const std::shared_ptr<WatchedNode> &other) {
-  const std::string peer = "two bare hand-offs";
+  const std::string peer = "two bare hand-offs", least = limit("two hand-offs, read, decode");
 
   const std::string idle = "change to callback, " + where;
   measure({idle}, [=](auto &state) {
@@ -259,6 +275,11 @@ void measureLatency(Cluster &cluster, const std::string &where, unsigned process
   })->UseManualTime();
   measure({idle, peer}, [=](auto &state) {
     HandOffs handOffs;
+    const OthersPinned pinned(processor);
+    bareLatency(state, handOffs);
+  })->UseManualTime();
+  measure({idle, least}, [=, &cluster](auto &state) {
+    HandOffs handOffs([&] { readEntry(cluster); });
     const OthersPinned pinned(processor);
     bareLatency(state, handOffs);
   })->UseManualTime();
@@ -278,9 +299,16 @@ void measureLatency(Cluster &cluster, const std::string &where, unsigned process
     const Stream stream([&] { handOffs.put(false); });
     bareLatency(state, handOffs);
   })->UseManualTime();
+  measure({streaming, least}, [=, &cluster](auto &state) {
+    HandOffs handOffs([&] { readEntry(cluster); });
+    const OthersPinned pinned(processor);
+    const Stream stream([&] { handOffs.put(false); });
+    bareLatency(state, handOffs);
+  })->UseManualTime();
 
   for (const std::string &work : {idle, streaming}) {
     ask(work + ", p50", 1.2, {peer});
+    ask(work + ", p50", 1.2, {least});
     ask(work + ", p99", 1.5, {peer});
   }
 }

@@ -8,12 +8,12 @@
 
 #include <cstring>
 #include <map>
-#include <set>
+#include <regex>
 #include <string>
 #include <vector>
 
 #include "host/directory/records.h"
-#include "host/kernel/log.h"
+#include "tests/log_lines.h"
 
 namespace {
 
@@ -22,20 +22,17 @@ using Bytes = std::vector<uint8_t>;
 /* Bytes of a test vector: text in single quotes stands for its characters with a CBOR head, the
  * rest is hexadecimal. */
 Bytes wire(const std::string &text) {
+  static const std::regex nameOrByte("'(.*?)'|[0-9a-f]{2}");
   Bytes bytes;
-  for (size_t i = 0; i < text.size();) {
-    if (text[i] == ' ') {
-      ++i;
-    } else if (text[i] == '\'') {
-      const std::string name = text.substr(i + 1, text.find('\'', i + 1) - i - 1);
-      if (name.size() >= 24) bytes.push_back(0x78);
-      bytes.push_back(static_cast<uint8_t>(name.size() + (name.size() < 24 ? 0x60 : 0)));
-      bytes.insert(bytes.end(), name.begin(), name.end());
-      i += name.size() + 2;
-    } else {
-      bytes.push_back(static_cast<uint8_t>(std::stoul(text.substr(i, 2), nullptr, 16)));
-      i += 2;
+  for (std::sregex_iterator part(text.begin(), text.end(), nameOrByte), end; part != end; ++part) {
+    const std::string name = part->str(1);
+    if (name.empty()) {
+      bytes.push_back(static_cast<uint8_t>(std::stoul(part->str(), nullptr, 16)));
+      continue;
     }
+    if (name.size() >= 24) bytes.push_back(0x78);
+    bytes.push_back(static_cast<uint8_t>(name.size() + (name.size() < 24 ? 0x60 : 0)));
+    bytes.insert(bytes.end(), name.begin(), name.end());
   }
   return bytes;
 }
@@ -57,11 +54,10 @@ KarstNetInterfaceEntry interfaceRecord() {
   record.bandwidth = 10'000'000'000;
   record.macAddress[5] = 1;
   record.agentV6Group[0] = 0xff;
-  record.masterV6Group[15] = 0x02;
+  record.masterV6Group[2] = 0x02;
   record.numIpAddresses = 7;
   record.ipAddresses[0].address[3] = 9;
-  record.ipAddresses[1].isIPv6 = 1;
-  record.ipAddresses[1].address[15] = 0x07;
+  record.ipAddresses[1] = {1, {}, {0, 0, 7}};
   record.trafficTypeMask = UINT64_MAX;
   return record;
 }
@@ -71,12 +67,10 @@ const std::string interfaceWire =
     "'agentGroupPort' 19 5b9b 'masterGroupPort' 19 3039 'multicastTTL' 05"
     "'bandwidth' 1b 00000002540be400 'macAddress' 46 000000000001"
     "'agentV6Group' 50 ff000000000000000000000000000000"
-    "'masterV6Group' 50 00000000000000000000000000000002"
-    "'numIpAddresses' 87 44 00000009 50 00000000000000000000000000000007"
+    "'masterV6Group' 50 00000200000000000000000000000000"
+    "'numIpAddresses' 87 44 00000009 50 00000700000000000000000000000000"
     "44 00000000 44 00000000 44 00000000 44 00000000 44 00000000"
     "'trafficTypeMask' 1b ffffffffffffffff";
-
-/* ---- The wire -------------------------------------------------------------------------------- */
 
 TEST(Marshaller, RecordsTravelAsMapsByFieldName) {
   const auto expectBothWays = [](const auto &record, const std::string &text) {
@@ -88,52 +82,36 @@ TEST(Marshaller, RecordsTravelAsMapsByFieldName) {
                  "'requiredTolmMajorVersion' 19 0100 'requiredTolmMinorVersion' 1a 00010000");
   expectBothWays(KarstHealthStatusEntry{1, 0, 0x1'0000'0000, UINT32_MAX, 0},
                  "a3 'healthFlags' 01 'timestamp' 1b 0000000100000000 'healthReason' 1a ffffffff");
-  expectBothWays(interfaceRecord(), interfaceWire);
-}
-
-/* Not even one that a writer put there, before the type or behind it. */
-TEST(Marshaller, AnotherNetworkTypeCarriesNoIpv4Address) {
   KarstNetInterfaceEntry record = interfaceRecord();
-  record.networkType = 9;
-  const Bytes bytes = host::encode(record);
-  EXPECT_EQ(Bytes(bytes.begin() + 1, bytes.begin() + 20), wire("'networkType' a1 'type' 09"));
-  record = {};
-  record.networkType = 9;
-  expectDecoded("a1 'networkType' a2 'type' 09 'ipv4' 44 c0000201", record);
-  expectDecoded("a1 'networkType' a2 'ipv4' 44 c0000201 'type' 09", record);
+  expectBothWays(record, interfaceWire);
+  record.networkType = 9; /* which has no IPv4 address */
+  EXPECT_EQ(host::encode(record), wire("aa 'networkType' a1 'type' 09" +
+                                       interfaceWire.substr(interfaceWire.find("'agentGroupP"))));
 }
 
-/* ---- What readers accept --------------------------------------------------------------------- */
-
+/* Rows of two texts that must mean the same. */
 TEST(Marshaller, TakesUnknownMissingAndIndefiniteThingsInAnyOrder) {
-  expectDecoded("a3 'flags' 02 'flag' 9f 'major' ff 'majorVersionNum' 01",
-                KarstNodeEntry{1, 0, 2, 0, 0});
-  KarstNetInterfaceEntry expected{};
-  expected.networkType = KARST_NETWORK_TYPE_IP;
-  expected.ipv4Address[3] = 4;
-  expected.numIpAddresses = 2;
-  expected.ipAddresses[1].address[0] = 9;
-  expectDecoded(
-      "bf 'networkType' bf 'ipv4' 5f 42 0000 40 42 0004 ff 'type' 01 ff"
-      "'macAddress' 5f 46 000000000000 ff 'numIpAddresses' 9f 44 00000000 5f 44 09000000 ff ff ff",
-      expected);
+  const std::string ofType9 = "a1 'networkType' a1 'type' 09";
+  const std::string rows[][2] = {
+      {"a3 'multicastTTL' 02 'multicast' 9f 'TTL' ff 'agentGroupPort' 01",
+       "a2 'agentGroupPort' 01 'multicastTTL' 02"},
+      {"bf 'networkType' bf 'ipv4' 5f 42 0000 40 42 0004 ff 'type' 01 ff"
+       "'macAddress' 5f 46 000000000001 ff 'numIpAddresses' 9f 44 00000000 5f 44 09000000 ff ff ff",
+       "a3 'networkType' a2 'type' 01 'ipv4' 44 00000004 'macAddress' 46 000000000001"
+       "'numIpAddresses' 82 44 00000000 44 09000000"},
+      {"a1 'networkType' a2 'type' 09 'ipv4' 44 c0000201", ofType9},
+      {"a1 'networkType' a2 'ipv4' 44 c0000201 'type' 09", ofType9}};
+  for (const auto &[text, plain] : rows) {
+    KarstNetInterfaceEntry record;
+    ASSERT_EQ(host::decode(wire(plain), &record), ZEL_OK) << plain;
+    expectDecoded(text, record);
+  }
 }
 
-/* ---- What is refused, and why ---------------------------------------------------------------- */
-
-const std::map<zel_Status, std::vector<std::string>> verdicts = {
-    {ZEL_OK,
-     {"a1 'x' 3b 0000000100000000", "a1 'x' fb 7ff0000000000000", "a1 'x' e0", "a1 'x' f8 ff",
-      "a1 'x' 58 02 ffff", "a1 'x' 5f 41 00 42 0000 ff", "a1 'x' 7f 'a' 'bc' ff",
-      "a1 'x' 9f 01 9f ff bf 'x' 00 ff ff", "a1 'x' a1 82 01 02 a0",   /* any name in there */
-      "a1 'x' c1 1a 00000000", "a1 'x' c7 00", "a1 'x' d9 d9f7 c0 60", /* tags */
-      "a1 'x' 818181818181818181818181818181 00",                      /* 16 deep */
-      "a1 'x' 91 8080808080808080808080808080808080"}},                /* wide is not deep */
+const std::map<zel_Status, std::vector<std::string>> refusals = {
     {EXPR_MSH_MALFORMED,
-     {"00", "c1 a0", "ff", "1c",                               /* no map at all */
-      "a1 01 02", "a1 7f 'bandwidth' ff 02",                   /* names that are none */
-      "bf 'x' ff", "a1 'bandwidth' ff",                        /* half a pair */
-      "a1 'x' 1f", "a1 'x' c1 ff", "a1 'x' f8 1f",             /* values that are none */
+     {"00", "c1 a0", "ff", "1c", "a1 01 02", "a1 7f 'bandwidth' ff 02", /* no map, no name */
+      "bf 'x' ff", "a1 'bandwidth' ff", "a1 'x' 1f", "a1 'x' c1 ff", "a1 'x' f8 1f", /* no value */
       "a1 'x' 5f 'text' ff", "a1 'macAddress' 5f 5f 40 ff ff", /* chunks of another kind */
       "a1 'x' 81818181818181818181818181818181 00",            /* 17 deep */
       "a2 'bandwidth' 01 'bandwidth' 01", "a1 'networkType' a2 'type' 01 'type' 01",
@@ -156,30 +134,22 @@ const std::map<zel_Status, std::vector<std::string>> verdicts = {
 };
 
 TEST(MarshallerRefusal, HasAStatusForEachFaultAndPassesOverUnknownValues) {
+  for (const std::string value :
+       {"3b 0000000100000000", "fb 7ff0000000000000", "e0", "f8 ff", "58 02 ffff",
+        "5f 41 00 42 0000 ff", "7f 'a' 'bc' ff", "9f 01 9f ff bf 'x' 00 ff ff", "a1 82 01 02 a0",
+        "c1 1a 00000000", "c6 00", "d4 00", "d9 d9f7 c0 60", "818181818181818181818181818181 00",
+        "91 8080808080808080808080808080808080"}) { /* wide, not deep */
+    expectDecoded("a1 'x'" + value, KarstNetInterfaceEntry{});
+  }
   KarstNetInterfaceEntry record;
-  for (const auto &[status, texts] : verdicts) {
-    for (const std::string &text : texts) {
-      EXPECT_EQ(host::decode(wire(text), &record), status) << text;
-    }
+  for (const auto &[status, texts] : refusals) {
+    for (const auto &text : texts) EXPECT_EQ(host::decode(wire(text), &record), status) << text;
   }
-}
-
-TEST(MarshallerRefusal, EveryCutIsTruncatedAndEveryDamagedByteHasAVerdict) {
-  std::set<zel_Status> seen;
   const Bytes whole = wire(interfaceWire);
-  for (size_t at = 0; at < whole.size(); ++at) {
-    /* A copy of its own, so that a read past the end is found. */
-    const Bytes cut(whole.begin(), whole.begin() + static_cast<ptrdiff_t>(at));
-    KarstNetInterfaceEntry record;
-    EXPECT_EQ(host::decode(cut, &record), EXPR_MSH_TRUNCATED) << "cut to " << at;
-    Bytes damaged = whole;
-    for (unsigned flip = 1; flip < 256; ++flip) {
-      damaged[at] = static_cast<uint8_t>(whole[at] ^ flip);
-      seen.insert(host::decode(damaged, &record));
-    }
+  for (auto end = whole.begin(); end != whole.end(); ++end) {
+    const Bytes cut(whole.begin(), end); /* a copy of its own: a read past its end is found */
+    EXPECT_EQ(host::decode(cut, &record), EXPR_MSH_TRUNCATED) << "cut to " << cut.size();
   }
-  for (const zel_Status status : seen) EXPECT_TRUE(verdicts.contains(status)) << status;
-  EXPECT_EQ(seen.size(), verdicts.size());
 }
 
 TEST(MarshallerRefusal, OfTablesThatAreNoneAndOfEightAddresses) {
@@ -196,18 +166,14 @@ TEST(MarshallerRefusal, OfTablesThatAreNoneAndOfEightAddresses) {
 }
 
 TEST(MarshallerRefusal, IsReportedWithTheRecordsName) {
-  std::vector<std::string> lines;
-  host::setLogSink([&](const host::LogLine &line) { lines.push_back(line.text); }, true);
+  const LogLines log;
+  const Bytes bytes = wire("a1 'flags' 40");
   KarstNodeEntry record{};
-  const auto decode = [&](const Bytes &bytes) {
-    return ExprMsh_UmshSingleStructure(nullptr, host::nodeRecordTable, bytes.data(), bytes.size(),
-                                       "KarstNodeEntry", &record);
-  };
-  EXPECT_EQ(decode(wire("a1 'flags' 01")), ZEL_OK);
-  EXPECT_EQ(decode(wire("a1 'flags' 40")), EXPR_MSH_BAD_TYPE);
-  host::setLogSink({}, false);
-  EXPECT_EQ(record.flags, 1u);
-  EXPECT_THAT(lines, testing::ElementsAre(testing::HasSubstr("KarstNodeEntry")));
+  ExprMsh_UmshSingleStructure(nullptr, host::nodeRecordTable, bytes.data(), bytes.size(),
+                              "KarstNodeEntry", &record);
+  EXPECT_THAT(log.texts,
+              testing::ElementsAre(
+                  "A KarstNodeEntry record of 8 bytes is refused at byte 8: status 0xbad0203"));
 }
 
 }  // namespace

@@ -11,12 +11,12 @@
 #include <thread>
 
 #include "host/kernel/heap.h"
-#include "host/kernel/log.h"
 #include "host/kernel/text.h"
 #include "host/threads/spinlock.h"
 #include "host/threads/sync.h"
 #include "host/threads/worlds.h"
 #include "platform/tolm.h"
+#include "tests/log_lines.h"
 
 using testing::ContainsRegex;
 using testing::ElementsAre;
@@ -24,10 +24,10 @@ using testing::ElementsAre;
 namespace {
 
 using Body = std::function<void()>;
+using Locks = std::vector<zel_SpinlockHandle>;
 
 zel_HeapID newHeap(uint32_t size) {
   zel_HeapProps props{};
-  host::fillName(&props.name, "test");
   props.maximumSize = size;
   zel_HeapID heap = ZEL_NO_HEAP;
   EXPECT_EQ(host::heapCreate(props, &heap), ZEL_OK);
@@ -38,15 +38,10 @@ zel_Status wait(uint32_t timeout = ZEL_TIMEOUT_NONE) {
   return zel_WorldWait(0, ZEL_NO_SPINLOCK, timeout, "for the test");
 }
 
-uint32_t runBody(void *body) {
-  (*static_cast<Body *>(body))();
-  return 0;
-}
-
 /* A heap, a domain and a lock; at its end nothing may be left alive. */
 class Threads : public testing::Test {
  protected:
-  Threads() : heap(newHeap(1 << 20)) {
+  Threads() {
     GTEST_FLAG_SET(death_test_style, "threadsafe");
     host::configureWorlds({});
     const zel_Name name = lockProps("Test", 0).name;
@@ -79,13 +74,30 @@ class Threads : public testing::Test {
     EXPECT_EQ(zel_SpinlockCreate(&props, &made), ZEL_OK);
     return made;
   }
+  static zel_Status start(zel_WorldID &world, const char *name, Body &body, zel_HeapID from) {
+    const auto run = [](void *data) { return (*static_cast<Body *>(data))(), 0u; };
+    return TOLM_WorldCreate(&world, name, 1, run, &body, 1, from);
+  }
   zel_WorldID start(const char *name, Body &body) const {
     zel_WorldID world = ZEL_NO_WORLD;
-    EXPECT_EQ(TOLM_WorldCreate(&world, name, 1, runBody, &body, 1, heap), ZEL_OK);
+    EXPECT_EQ(start(world, name, body, heap), ZEL_OK);
     return world;
   }
+  /* Runs `holding` under the lock while another thread waits for it, known to its holder. */
+  void holdWithWaiter(const Body &holding) const {
+    zel_SpinlockLock(lock);
+    const std::jthread waiter([this] {
+      zel_SpinlockLock(lock);
+      EXPECT_FALSE(tolmapi_PreemptionIsPending()); /* now it is the holder, and nobody waits */
+      zel_SpinlockUnlock(lock);
+    });
+    while (record().waiters == 0) std::this_thread::yield();
+    holding();
+    zel_SpinlockUnlock(lock);
+  }
+  host::Spinlock &record() const { return host::lockOf(lock); }
 
-  zel_HeapID heap;
+  zel_HeapID heap = newHeap(1 << 20);
   zel_LockDomainID domain = ZEL_NO_LOCK_DOMAIN;
   zel_SpinlockHandle lock = ZEL_NO_SPINLOCK;
   uint32_t usedAtStart = 0;
@@ -95,98 +107,75 @@ class Threads : public testing::Test {
 
 using Spinlocks = Threads;
 
-TEST_F(Spinlocks, ExcludeEachOther) {
-  constexpr int kRounds = 50'000;
-  int counter = 0; /* plain: only the lock guards it */
-  const auto count = [&] {
-    for (int i = 0; i < kRounds; ++i) {
-      zel_SpinlockLock(lock);
-      const int seen = counter;
-      if (i % 64 == 0) std::this_thread::yield(); /* the others find the lock held */
-      counter = seen + 1;
-      zel_SpinlockUnlock(lock);
-    }
-  };
-  { const std::jthread a(count), b(count), c(count), d(count); }
-  EXPECT_EQ(counter, 4 * kRounds);
-}
-
-/* The last of two users destroys the lock right after its own unlock, while the other may still be
- * on its way out of its unlock. */
-TEST_F(Spinlocks, MayBeDestroyedByTheirLastUserAtOnce) {
-  for (int round = 0; round < 1'000; ++round) {
+/* The last of four users destroys the lock right after its own unlock, while another may still be on
+ * its way out of its unlock. */
+TEST_F(Spinlocks, ExcludeEachOtherAndMayBeDestroyedByTheirLastUserAtOnce) {
+  constexpr int kRounds = 500, kEach = 100;
+  for (int round = 0; round < kRounds; ++round) {
     const zel_SpinlockHandle shared = newLock("Shared", 1);
     EXPECT_EQ(used() - usedAtStart, zel_SpinlockAllocSize(ZEL_SPINLOCK_RANKED));
-    int users = 2;
-    const auto leave = [&] {
-      zel_SpinlockLock(shared);
-      const bool last = --users == 0;
-      zel_SpinlockUnlock(shared);
-      if (last) zel_SpinlockDestroy(shared);
+    int counter = 0; /* plain: only the lock guards it */
+    const auto count = [&] {
+      for (int mine = 1, all = 0; mine <= kEach; ++mine) {
+        zel_SpinlockLock(shared);
+        const int seen = counter;
+        if (mine % 64 == 0) std::this_thread::yield(); /* the others find the lock held */
+        counter = all = seen + 1;
+        zel_SpinlockUnlock(shared);
+        if (all == 4 * kEach) zel_SpinlockDestroy(shared);
+      }
     };
-    {
-      const std::jthread other(leave);
-      leave();
-    }
-    EXPECT_EQ(used(), usedAtStart);
+    { const std::jthread a(count), b(count), c(count), d(count); }
+    ASSERT_EQ(counter, 4 * kEach);
+    ASSERT_EQ(used(), usedAtStart);
   }
 }
 
-TEST_F(Spinlocks, AreRefusedWithBadPropertiesOrWithoutMemory) {
+/* Who comes while somebody spins lets them go first; but not for long, since they may have lost their
+ * processor: here they never had one. */
+TEST_F(Spinlocks, AreLeftToWhoSpinsForThemUnlessNobodyTakesThem) {
+  holdWithWaiter([this] {
+    while (!record().wanted) std::this_thread::yield();
+  });
+  EXPECT_FALSE(record().wanted) << "who took it wants it no more";
+  record().wanted = true;
+  zel_SpinlockLock(lock);
+  EXPECT_FALSE(record().wanted) << "who came gave them the time, and up";
+  zel_SpinlockUnlock(lock);
+}
+
+TEST_F(Spinlocks, AreRefusedWithBadPropertiesOrWithoutMemoryAsWorldsAre) {
   const zel_HeapID tiny = newHeap(16);
+  uint64_t untouched = 42;
   const auto create = [&](uint32_t type, zel_HeapID from, zel_LockDomainID owner) {
     zel_SpinlockProps props = lockProps("Refused", 1);
-    props.type = type;
-    props.heap = from;
-    props.domain = owner;
-    zel_SpinlockHandle refused = 42;
-    const zel_Status status = zel_SpinlockCreate(&props, &refused);
-    EXPECT_EQ(refused, 42u);
-    return status;
+    std::tie(props.type, props.heap, props.domain) = std::tie(type, from, owner);
+    return zel_SpinlockCreate(&props, &untouched);
   };
   EXPECT_EQ(create(7, heap, domain), ZEL_BAD_PARAM);
   EXPECT_EQ(create(ZEL_SPINLOCK_RANKED, heap + 1000, domain), ZEL_BAD_PARAM);
   EXPECT_EQ(create(ZEL_SPINLOCK_RANKED, heap, ZEL_NO_LOCK_DOMAIN), ZEL_BAD_PARAM);
   EXPECT_EQ(create(ZEL_SPINLOCK_RANKED, tiny, domain), ZEL_NO_MEMORY);
+  EXPECT_EQ(untouched, 42u);
   zel_WorldID world = 42;
-  EXPECT_EQ(TOLM_WorldCreate(&world, "none", 1, runBody, nullptr, 1, tiny), ZEL_NO_MEMORY);
+  Body none;
+  EXPECT_EQ(start(world, "none", none, tiny), ZEL_NO_MEMORY);
   EXPECT_EQ(world, 42u);
   host::heapDestroy(tiny);
 }
 
 TEST_F(Spinlocks, LeftBehindAreReportedByTheirDomainAndReleased) {
-  std::vector<std::string> lines;
-  host::setLogSink([&](const host::LogLine &line) { lines.push_back(line.text); }, true);
+  const LogLines log;
   newLock("Lost", 2);
   zel_SpinlockDestroy(std::exchange(lock, newLock("Second", 3)));
   zel_LockDomainDestroy(std::exchange(domain, ZEL_NO_LOCK_DOMAIN));
   lock = ZEL_NO_SPINLOCK;
-  host::setLogSink({}, false);
-  EXPECT_THAT(lines, testing::UnorderedElementsAre(ContainsRegex("Test.*Lost"),
-                                                   ContainsRegex("Test.*Second")));
+  EXPECT_THAT(log.texts, testing::UnorderedElementsAre(ContainsRegex("Test.*Lost"),
+                                                       ContainsRegex("Test.*Second")));
   EXPECT_EQ(used(), 0u);
 }
 
-/* ---- Preemption ------------------------------------------------------------------------------ */
-
-class Preemption : public Threads {
- protected:
-  /* Runs `holding` under the lock while another thread waits for it, known to its holder. */
-  void holdWithWaiter(const Body &holding) {
-    zel_SpinlockLock(lock);
-    const std::jthread waiter([this] {
-      zel_SpinlockLock(lock);
-      EXPECT_FALSE(tolmapi_PreemptionIsPending()); /* now it is the holder, and nobody waits */
-      zel_SpinlockUnlock(lock);
-    });
-    const host::Spinlock &record = host::lockOf(lock);
-    while (record.waiters.load() == 0) std::this_thread::yield();
-    holding();
-    zel_SpinlockUnlock(lock);
-  }
-};
-
-TEST_F(Preemption, IsDueOnceForAHolderBeyondTheSliceWhomSomebodyWaitsFor) {
+TEST_F(Spinlocks, AskForPreemptionOnceOfAHolderBeyondTheSliceWhomSomebodyWaitsFor) {
   host::configureWorlds({.lockSlice = std::chrono::microseconds(0)});
   holdWithWaiter([] {
     while (!tolmapi_PreemptionIsPending()) std::this_thread::yield();
@@ -196,16 +185,13 @@ TEST_F(Preemption, IsDueOnceForAHolderBeyondTheSliceWhomSomebodyWaitsFor) {
     std::thread([] { EXPECT_FALSE(tolmapi_PreemptionIsPending()); }).join();
   });
   /* A lock that changed hands is newly held, however long its waiters have been there. */
-  host::Spinlock &record = host::lockOf(lock);
   zel_SpinlockLock(lock);
   EXPECT_FALSE(tolmapi_PreemptionIsPending());
-  ++record.waiters; /* one that the lock was not asked about yet */
+  EXPECT_FALSE(record().timed) << "nobody waits yet";
+  ++record().waiters; /* one that the lock was not asked about yet */
   EXPECT_FALSE(tolmapi_PreemptionIsPending());
-  --record.waiters;
+  --record().waiters;
   zel_SpinlockUnlock(lock);
-}
-
-TEST_F(Preemption, IsNotDueWithinTheSlice) {
   host::configureWorlds({.lockSlice = std::chrono::hours(1)});
   holdWithWaiter([] { EXPECT_FALSE(tolmapi_PreemptionIsPending()); });
 }
@@ -214,28 +200,30 @@ TEST_F(Preemption, IsNotDueWithinTheSlice) {
 
 using Worlds = Threads;
 
-/* Somebody wakes them all the while, before and after their time too. */
-TEST_F(Worlds, KnowTheirIDBeforeTheyRunAndLeaveNothingBehind) {
+/* Somebody wakes them all the while, before and after their time too. The stop finds a world that
+ * never sleeps; it outlives the wait that reports it, and a wake-up does not hide it. */
+TEST_F(Worlds, KnowTheirIDBeforeTheyRunStopAtEveryWaitAndLeaveNothingBehind) {
   std::atomic<zel_WorldID> target{ZEL_NO_WORLD};
   std::jthread waker([&](const std::stop_token &finished) {
     while (!finished.stop_requested()) zel_WorldForceWakeup(target);
   });
   for (int round = 0; round < 200; ++round) {
-    zel_WorldID world = ZEL_NO_WORLD;
-    zel_WorldID seen = ZEL_NO_WORLD;
+    zel_WorldID world = ZEL_NO_WORLD, seen = ZEL_NO_WORLD;
+    zel_Status last = ZEL_OK;
     Body body = [&] {
       seen = std::atomic_ref(world).load();
-      while (wait() == ZEL_OK) {
+      while (wait(0) == ZEL_OK) {
       }
+      zel_WorldForceWakeup(seen);
+      last = wait();
     };
-    ASSERT_EQ(TOLM_WorldCreate(&world, "brief", 1, runBody, &body, 1, heap), ZEL_OK);
+    ASSERT_EQ(start(world, "brief", body, heap), ZEL_OK);
     const zel_WorldID id = world;
     EXPECT_NE(id, target.exchange(id)) << "the last one's";
     EXPECT_GT(used(), usedAtStart); /* the record is the given heap's */
     TOLM_WorldDestroy(&world);
-    EXPECT_EQ(seen, id);
-    EXPECT_EQ(world, ZEL_NO_WORLD);
-    EXPECT_EQ(used(), usedAtStart);
+    EXPECT_EQ(std::tuple(seen, last, world, used()),
+              std::tuple(id, ZEL_WORLD_STOPPING, ZEL_NO_WORLD, usedAtStart));
   }
 }
 
@@ -266,8 +254,7 @@ TEST_F(Worlds, KeepAWakeUpUntilTheNextWaitAndUseItUp) {
 /* Queue under the lock, then wake: the way of every user. A lost wake-up leaves work undone at an
  * idle moment. */
 TEST_F(Worlds, LoseNoWakeUpThatRacesTheWait) {
-  int queued = 0;
-  int done = 0;
+  int queued = 0, done = 0;
   Body body = [&] {
     do {
       zel_SpinlockLock(lock);
@@ -276,34 +263,27 @@ TEST_F(Worlds, LoseNoWakeUpThatRacesTheWait) {
     } while (wait() == ZEL_OK);
   };
   zel_WorldID world = start("worker", body);
-  for (int round = 1; round <= 5'000; ++round) {
-    for (int i = 0; i < 2; ++i) {
-      zel_SpinlockLock(lock);
-      ++queued;
-      zel_WorldForceWakeup(world); /* allowed under the lock */
-      zel_SpinlockUnlock(lock);
-    }
+  for (int added = 1; added <= 10'000; ++added) {
+    zel_SpinlockLock(lock);
+    ++queued;
+    zel_WorldForceWakeup(world); /* allowed under the lock */
+    zel_SpinlockUnlock(lock);
+    if (added % 2 != 0) continue;
     host::waitUntilWorldsIdle();
-    ASSERT_EQ(done, 2 * round);
+    ASSERT_EQ(done, added);
   }
   TOLM_WorldDestroy(&world);
 }
 
-/* The world never sleeps, so the stop finds it running; a stop outlives the wait that reports it,
- * and a wake-up does not hide it. */
 /* Put off, a wake-up is made at the end, when another world is woken, or when the thread blocks; never
  * lost, which this test would wait for in vain. */
 TEST_F(Worlds, GetWakeUpsThatWerePutOff) {
   std::counting_semaphore<> woken(0);
   std::atomic<int> times{0};
   Body body = [&] {
-    while (wait() == ZEL_OK) {
-      ++times;
-      woken.release();
-    }
+    for (; wait() == ZEL_OK; woken.release()) ++times;
   };
-  zel_WorldID one = start("one", body);
-  zel_WorldID other = start("other", body);
+  zel_WorldID one = start("one", body), other = start("other", body);
   host::waitUntilWorldsIdle();
   {
     const host::WakeUpsPutOff putOff;
@@ -320,82 +300,46 @@ TEST_F(Worlds, GetWakeUpsThatWerePutOff) {
     zel_WorldSleep(0);
     woken.acquire();
   }
-  host::waitUntilWorldsIdle();
   EXPECT_EQ(times, 3);
-  TOLM_WorldDestroy(&one);
-  TOLM_WorldDestroy(&other);
-}
-
-TEST_F(Worlds, StopAtEveryWaitAfterTheStop) {
-  std::latch timedOut(1);
-  zel_Status later = ZEL_OK;
-  zel_WorldID world = ZEL_NO_WORLD;
-  Body body = [&] {
-    EXPECT_EQ(wait(1), ZEL_OK);
-    timedOut.count_down();
-    while (wait(0) == ZEL_OK) {
-    }
-    zel_WorldForceWakeup(std::atomic_ref(world).load());
-    later = wait();
-  };
-  ASSERT_EQ(TOLM_WorldCreate(&world, "runner", 1, runBody, &body, 1, heap), ZEL_OK);
-  timedOut.wait();
-  TOLM_WorldDestroy(&world);
-  EXPECT_EQ(later, ZEL_WORLD_STOPPING);
+  for (zel_WorldID *world : {&one, &other}) TOLM_WorldDestroy(world);
 }
 
 /* ---- What is fatal --------------------------------------------------------------------------- */
 
 /* Found by its name in the backtrace of a world that hangs. */
-extern "C" void takeBoth(zel_SpinlockHandle first, zel_SpinlockHandle second);
-extern "C" [[gnu::noinline]] void takeBoth(zel_SpinlockHandle first, zel_SpinlockHandle second) {
-  zel_SpinlockLock(first);
-  zel_SpinlockLock(second);
-  zel_SpinlockUnlock(second);
+extern "C" [[gnu::noinline]] void takeAll(const Locks &locks) {
+  for (const zel_SpinlockHandle lock : locks) zel_SpinlockLock(lock);
 }
 
 class ThreadsDeathTest : public Threads {
  protected:
-  ThreadsDeathTest() : middle(newLock("Middle", 6)), high(newLock("High", 7)) {
-    host::configureWorlds({.stopTimeout = std::chrono::milliseconds(20)});
-  }
-  ~ThreadsDeathTest() override {
-    zel_SpinlockDestroy(middle);
-    zel_SpinlockDestroy(high);
-  }
+  ThreadsDeathTest() { host::configureWorlds({.stopTimeout = std::chrono::milliseconds(20)}); }
+  ~ThreadsDeathTest() override { std::for_each(more.begin(), more.end(), zel_SpinlockDestroy); }
 
-  static void take(const std::vector<zel_SpinlockHandle> &locks) {
-    std::for_each(locks.begin(), locks.end(), zel_SpinlockLock);
-  }
   /* For bodies that must not come back. */
   void runToDeath(Body body) const {
     zel_WorldID world = start("Doomed", body);
     TOLM_WorldDestroy(&world);
   }
 
-  zel_SpinlockHandle middle;
-  zel_SpinlockHandle high;
+  const Locks more{newLock("Equal", 5), newLock("Middle", 6), newLock("High", 7)};
+  const zel_SpinlockHandle equal = more[0], middle = more[1], high = more[2];
 };
 
 TEST_F(ThreadsDeathTest, MistakesAreNamed) {
-  struct Mistake {
-    Body commit;
-    const char *message;
-  };
-  const zel_SpinlockHandle equal = newLock("Equal", 5);
-  const std::vector<Mistake> mistakes = {
+  const std::vector<std::pair<Body, const char *>> mistakes = {
       {[&] {
-         take({lock, equal});
+         takeAll({lock, equal});
        },
        "spinlock \"Equal\" \\(rank 5\\) is taken while \"First\" \\(rank 5\\) is held"},
       {[&] {
-         take({lock, middle, high});
+         takeAll({lock, middle, high});
          zel_SpinlockUnlock(middle); /* out of order: High is still held */
          zel_SpinlockLock(middle);
        },
        "\"Middle\" \\(rank 6\\) is taken while \"High\" \\(rank 7\\)"},
       {[&] {
-         take({lock, high, lock});
+         takeAll({lock, high, lock});
        },
        "spinlock \"First\" \\(rank 5\\) is taken again by the thread that holds"},
       {[&] {
@@ -405,9 +349,9 @@ TEST_F(ThreadsDeathTest, MistakesAreNamed) {
        },
        "spinlock \"First\" is unlocked by thread \"thief\".* held by thread \"owner\""},
       {[&] { zel_SpinlockUnlock(lock); }, "\"First\" .*nobody holds it"},
-      {[&] { take({lock}), zel_SpinlockDestroy(lock); },
+      {[&] { zel_SpinlockLock(lock), zel_SpinlockDestroy(lock); },
        "spinlock \"First\" is destroyed while thread"},
-      {[&] { take({lock}), zel_WorldSleep(1); }, "sleeps .*\"First\""},
+      {[&] { zel_SpinlockLock(lock), zel_WorldSleep(1); }, "sleeps .*\"First\""},
       {[&] { runToDeath([&] { zel_SpinlockLock(lock), wait(); }); },
        "waits \\(for the test\\) .*\"First\""},
       {[&] { runToDeath([&] { zel_SpinlockLock(lock); }); },
@@ -417,34 +361,27 @@ TEST_F(ThreadsDeathTest, MistakesAreNamed) {
       {[&] {
          zel_WorldID world = ZEL_NO_WORLD; /* known to the body from its first instruction on */
          Body body = [&] { TOLM_WorldDestroy(&world); };
-         TOLM_WorldCreate(&world, "Suicidal", 1, runBody, &body, 1, heap);
+         start(world, "Suicidal", body, heap);
          host::waitUntilWorldsIdle();
        },
        "\"Suicidal\".*destroys itself"},
+      {[&] {
+         std::latch held(1);
+         std::thread([&] {
+           zel_SpinlockLock(high);
+           held.count_down();
+           pause();
+         }).detach();
+         held.wait();
+         runToDeath([&] {
+           wait(1);
+           takeAll({lock, high});
+         });
+       },
+       "world \"Doomed\" .*does not stop within 20 ms \\(running, last wait: for the test"
+       "\\)\n.*holds spinlock \"First\"\n.*waits for spinlock \"High\"\n(.*\n)*.*takeAll"},
   };
-  for (const Mistake &mistake : mistakes) {
-    EXPECT_DEATH(mistake.commit(), mistake.message);
-  }
-  zel_SpinlockDestroy(equal);
-}
-
-TEST_F(ThreadsDeathTest, AStopThatHangsSaysWhichWorldAndWhere) {
-  const auto hang = [&] {
-    std::latch held(1);
-    std::thread([&] {
-      zel_SpinlockLock(high);
-      held.count_down();
-      pause();
-    }).detach();
-    held.wait();
-    runToDeath([&] {
-      wait(1);
-      takeBoth(lock, high);
-    });
-  };
-  EXPECT_DEATH(hang(),
-               "world \"Doomed\" .*does not stop within 20 ms \\(running, last wait: for the test"
-               "\\)\n.*holds spinlock \"First\"\n.*waits for spinlock \"High\"\n(.*\n)*.*takeBoth");
+  for (const auto &[commit, message] : mistakes) EXPECT_DEATH(commit(), message);
 }
 
 }  // namespace

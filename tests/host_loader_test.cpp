@@ -7,7 +7,6 @@
 #include <unistd.h>
 
 #include <fstream>
-#include <random>
 
 namespace {
 
@@ -15,7 +14,8 @@ using testing::ElementsAre;
 using testing::HasSubstr;
 using testing::Pair;
 
-std::vector<std::pair<std::string, int64_t>> events; /* what the modules told, in order */
+using Events = std::vector<std::pair<std::string, int64_t>>;
+Events events; /* what the modules told, in order */
 
 std::string modulePath(const std::string &name) {
   return TEST_MODULES "/" + name + ".so";
@@ -31,10 +31,6 @@ std::string errorOf(Action action) {
   return "no error";
 }
 
-std::string fileError(const std::string &path) {
-  return errorOf([&] { host::ModuleFile{path}; });
-}
-
 class Loader : public testing::Test {
  protected:
   Loader() {
@@ -44,6 +40,9 @@ class Loader : public testing::Test {
   }
   ~Loader() override { std::filesystem::remove(scratch); }
 
+  std::string fileError(const std::filesystem::path &path) const {
+    return errorOf([&] { host::ModuleFile{path}; });
+  }
   /* A new file each time: some file systems flush one that is cut to nothing and written again. */
   std::string bytesError(const std::string &bytes) const {
     std::filesystem::remove(scratch);
@@ -64,7 +63,7 @@ class Loader : public testing::Test {
 
 /* ---- The file -------------------------------------------------------------------------------- */
 
-TEST_F(Loader, RefusesEachFaultOfAFileByName) {
+TEST_F(Loader, RefusesEachFaultOfAFileByNameAndEveryCut) {
   const char *const faults[] = {"no error",
                                 "has no section .karst.modinfo",
                                 "has no section .karst.required",
@@ -78,28 +77,22 @@ TEST_F(Loader, RefusesEachFaultOfAFileByName) {
   for (size_t fault = 0; fault < std::size(faults); fault++) {
     EXPECT_THAT(fileError(modulePath("broken" + std::to_string(fault))), HasSubstr(faults[fault]));
   }
-  EXPECT_THAT(bytesError(std::string(good).replace(offsetof(Elf64_Ehdr, e_machine), 1, "\xb7")),
-              HasSubstr("built for another machine"));
-  EXPECT_THAT(bytesError(std::string(good).replace(offsetof(Elf64_Ehdr, e_type), 1, "\1")),
-              HasSubstr("not a shared object"));
-}
-
-TEST_F(Loader, CutAndMangledFilesDoNoHarm) {
+  const auto *header = reinterpret_cast<const Elf64_Ehdr *>(good.data());
+  const size_t section = header->e_shoff + sizeof(Elf64_Shdr), segment = header->e_phoff;
+  const std::tuple<size_t, char, const char *> damages[] = {
+      {offsetof(Elf64_Ehdr, e_machine), '\xb7', "built for another machine"},
+      {offsetof(Elf64_Ehdr, e_type), ET_REL, "not a shared object"},
+      {offsetof(Elf64_Ehdr, e_shoff) + 5, 1, "is cut short; build"},
+      {section + offsetof(Elf64_Shdr, sh_offset) + 5, 1, "a section lies outside"},
+      {segment + offsetof(Elf64_Phdr, p_offset) + 5, 1, "a segment lies outside"},
+  };
+  for (const auto &[place, byte, reason] : damages) {
+    std::string bytes = good;
+    bytes[place] = byte;
+    EXPECT_THAT(bytesError(bytes), HasSubstr(reason));
+  }
   for (size_t length = 0; length < good.size(); length += 61) {
     EXPECT_NE(bytesError(good.substr(0, length)), "no error") << length;
-  }
-  /* The tables that pointers and sizes come from lie at both ends of the file. */
-  std::mt19937 random(20240607);
-  const size_t ends = std::min<size_t>(4096, good.size());
-  for (int round = 0; round < 3000; round++) {
-    std::string bytes = good;
-    for (unsigned changes = 1 + random() % 8; changes > 0; changes--) {
-      size_t place = random() % bytes.size();
-      if (round % 3 == 0) place %= ends;
-      if (round % 3 == 1) place = bytes.size() - 1 - place % ends;
-      bytes[place] = static_cast<char>(random() % 4 == 0 ? 0xff : random());
-    }
-    bytesError(bytes);
   }
 }
 
@@ -185,10 +178,10 @@ TEST_F(Loader, AKeptModuleBeginsAfreshAndIsOutOfReachMeanwhile) {
   };
   const auto loadTwice = [&] {
     loadOnce();
-    const auto first = events;
+    const Events first = std::exchange(events, {});
     loadOnce();
-    const bool equal = events[0] == first[0] && events[2] == first[2];
-    _exit(equal && events[2] == std::pair<std::string, int64_t>("provider cleanup", 41) ? 0 : 1);
+    events[1] = first[1]; /* the ID is another one */
+    _exit(events == first && events[2] == Events::value_type("provider cleanup", 41) ? 0 : 1);
   };
   EXPECT_EXIT(loadTwice(), testing::ExitedWithCode(0), "");
   EXPECT_DEATH(loadOnce()(), "");

@@ -15,10 +15,10 @@
 #include <regex>
 
 #include "host/directory/records.h"
-#include "host/kernel/log.h"
 #include "host/sources/cluster_file_source.h"
 #include "host/sources/machine_uuid.h"
 #include "host/sources/own_interfaces_source.h"
+#include "tests/log_lines.h"
 
 namespace {
 
@@ -176,37 +176,27 @@ TEST(ClusterFile, EveryFieldOfAnInterfaceReachesItsRecord) {
       "agentV6Group":"ff02::2:3:4", "masterV6Group":"ff02::1:2:3")"));
   for (const Entry &entry : content.entries) EXPECT_EQ(entry.owner, uuid("a1"));
   const auto record = interfaceRecord(content.entries, uuid("b1"));
-  EXPECT_EQ(record.networkType, 1u);
   EXPECT_THAT(texts(record.ipAddresses, record.numIpAddresses),
               ElementsAre("2001:db8::7", "192.0.2.7"));
   EXPECT_THAT(record.ipv4Address, ElementsAre(198, 51, 100, 7));
-  EXPECT_EQ(record.trafficTypeMask, 0x8000000000000003u);
   EXPECT_THAT(record.macAddress, ElementsAre(0x02, 0x00, 0x5e, 0x10, 0x0a, 0xff));
-  EXPECT_EQ(record.bandwidth, 9223372036854775807u);
-  EXPECT_EQ(record.agentGroupPort, 12345u);
-  EXPECT_EQ(record.masterGroupPort, 23451u);
-  EXPECT_EQ(record.multicastTTL, 5u);
-  EXPECT_EQ(record.agentV6Group[15], 0x04);
-  EXPECT_EQ(record.masterV6Group[15], 0x03);
+  EXPECT_EQ(std::tuple(record.networkType, record.trafficTypeMask, record.bandwidth,
+                       record.agentGroupPort, record.masterGroupPort, record.multicastTTL,
+                       record.agentV6Group[15], record.masterV6Group[15]),
+            std::tuple(1, 0x8000000000000003, INT64_MAX, 12345, 23451, 5, 4, 3));
 }
 
 TEST(ClusterFile, AnInterfaceIsHealthyForAllTrafficByDefaultElseBadOrUnknown) {
-  const auto entries = parse(interface(R"("name":"eth0")")).entries;
-  const auto record = interfaceRecord(entries, uuid("b1"));
+  const auto record = interfaceRecord(parse(interface(R"("name":"eth0")")).entries, uuid("b1"));
   EXPECT_EQ(record.networkType, KARST_NETWORK_TYPE_IP);
   EXPECT_EQ(record.trafficTypeMask, 0u);
-  EXPECT_EQ(healthFlags(entries, uuid("b1")), 0u);
   const auto flags = [](const char *fields) {
     return healthFlags(parse(interface(fields)).entries, uuid("b1"));
   };
+  EXPECT_EQ(flags(R"("name":"eth0")"), 0u);
   EXPECT_EQ(flags(R"("healthy":false)"), 1u);
   EXPECT_EQ(flags(R"("healthy":false,"healthFlags":6)"), 6u);
   EXPECT_THROW(flags(R"("healthy":null)"), std::out_of_range);
-}
-
-TEST(ClusterFile, RawRecordsGoIntoTheDirectoryAsTheyAre) {
-  const auto content = parse(node(R"("rawRecord":"00fF")"));
-  EXPECT_THAT(content.entries.at(0).data, ElementsAre(0x00, 0xff));
 }
 
 TEST(ClusterFile, ObjectsMayShareAUUIDAcrossTypesAndBelongToSelf) {
@@ -217,7 +207,8 @@ TEST(ClusterFile, ObjectsMayShareAUUIDAcrossTypesAndBelongToSelf) {
   EXPECT_EQ(content.names.at(uuid("c1")), "volume");
 }
 
-TEST(ClusterFile, TheExampleIsGoodAndNamesItsNodes) {
+TEST(ClusterFile, RawRecordsAreTakenAsTheyAreAndTheExampleIsGood) {
+  EXPECT_THAT(parse(node(R"("rawRecord":"00fF")")).entries.at(0).data, ElementsAre(0x00, 0xff));
   EXPECT_GE(host::parseClusterFile(CLUSTER_EXAMPLE).names.size(), 9u);
 }
 
@@ -245,14 +236,12 @@ TEST(Difference, BuildsFromTheGroundUpAndTakesDownFromTheTop) {
 class ClusterFileReload : public Test {
  protected:
   ClusterFileReload() {
-    host::setLogSink([](const host::LogLine &) {}, true);
     std::filesystem::create_directory(folder_);
     source_.emplace(path(), directory_);
   }
   ~ClusterFileReload() override {
     source_.reset();
     std::filesystem::remove_all(folder_);
-    host::setLogSink({}, false);
   }
 
   std::string path(const char *name = "cluster.json") const { return folder_ / name; }
@@ -280,6 +269,7 @@ class ClusterFileReload : public Test {
     return healthFlags(directory_.entries(KARST_TYPE_HEALTH_STATUS), uuid("b1"));
   }
 
+  const LogLines log_;
   const std::filesystem::path folder_{TempDir() + "cluster." + std::to_string(getpid())};
   host::Directory directory_;
   std::mutex mutex_;
@@ -294,23 +284,23 @@ TEST_F(ClusterFileReload, SubscribersHearOfTheDifferenceAlone) {
   KarstQuery query{};
   query.type = KARST_TYPE_NET_INTERFACE;
   query.flags = KARST_QUERY_BY_TYPE | KARST_QUERY_ALL | KARST_QUERY_REPLICA;
-  const KarstSubscriptionFn listen = [](void *data, const KarstEntryHeader *header, void *,
+  const KarstSubscriptionFn listen = [](void *to, const KarstEntryHeader *header, void *,
                                         zel_Status status) -> zel_Status {
-    const char *sign = status == ZEL_OK ? "+" : status == ZEL_NOT_FOUND ? "-" : nullptr;
-    if (sign != nullptr)
-      *static_cast<std::string *>(data) += sign + toString(header->uuid).substr(34);
+    if (status == ZEL_SUB_CANCELLED) return ZEL_OK;
+    *static_cast<std::string *>(to) +=
+        (status == ZEL_OK ? "+" : "-") + toString(header->uuid).substr(34);
     return ZEL_OK;
   };
-  write(node(R"("interfaces":[{"uuid":@b1},{"uuid":@b2},{"uuid":@b3}])"));
-  source_->load();
-  directory_.put({KARST_TYPE_NET_INTERFACE, uuid("b9"), uuid("a9"), {}}); /* another source's */
+  const auto load = [&](const char *interfaces) {
+    write(node(std::string("\"interfaces\":[") + interfaces + "]"));
+    source_->load();
+    directory_.waitUntilIdle();
+  };
   ASSERT_EQ(directory_.subscribe(&query, listen, &heard), ZEL_OK);
-  directory_.waitUntilIdle();
-  heard.clear();
-  write(node(R"("interfaces":[{"uuid":@b4},{"uuid":@b2,"ipv4":"192.0.2.1"},{"uuid":@b1}])"));
-  source_->load();
-  directory_.waitUntilIdle();
-  EXPECT_EQ(heard, "-b3+b2+b4");
+  directory_.put({KARST_TYPE_NET_INTERFACE, uuid("b9"), uuid("a9"), {}}); /* another source's */
+  load(R"({"uuid":@b1},{"uuid":@b2},{"uuid":@b3})");
+  load(R"({"uuid":@b4},{"uuid":@b2,"ipv4":"192.0.2.1"},{"uuid":@b1})");
+  EXPECT_EQ(heard, "+b9+b1+b2+b3-b3+b2+b4");
   directory_.unsubscribe(&query, listen, &heard);
   directory_.waitUntilIdle();
 }
@@ -364,8 +354,7 @@ TEST(MachineUUID, IsTheMachineIdOrACallForAnotherSource) {
   }
 }
 
-TEST(NamedUUID, FollowsFromOwnerAndNameAlone) {
-  /* The standard's own example: the DNS name space and a host name. */
+TEST(NamedUUID, FollowsFromOwnerAndNameAlone) { /* the standard's own example */
   const zel_UUID dns = host::parseUUID("6ba7b810-9dad-11d1-80b4-00c04fd430c8").value();
   EXPECT_EQ(toString(host::namedUUID(dns, "www.example.com")),
             "2ed6657d-e927-568b-95e1-2665a8aea6a2");
@@ -374,37 +363,31 @@ TEST(NamedUUID, FollowsFromOwnerAndNameAlone) {
 /* ---- This machine's interfaces --------------------------------------------------------------- */
 
 host::OwnAddress own(const std::string &text, bool local = false, bool passing = false) {
-  host::OwnAddress result;
+  host::OwnAddress result{{}, local, passing};
   result.address.isIPv6 = text.find(':') != std::string::npos;
   inet_pton(result.address.isIPv6 ? AF_INET6 : AF_INET, text.c_str(), result.address.address);
-  result.local = local;
-  result.passing = passing;
   return result;
 }
 
-TEST(OwnInterfaces, AddressesComeInAnOrderThatDoesNotDependOnTheSystem) {
-  host::OwnInterface eth0;
-  eth0.addresses = {own("2001:db8::9", false, true),
-                    own("2001:db8::1"),
-                    own("fe80::1", true),
-                    own("192.0.2.9"),
-                    own("192.0.2.4"),
-                    own("192.0.2.1", false, true)};
-  for (int turn = 0; turn < 2; turn++) {
-    EXPECT_THAT(texts(host::publishedAddresses(eth0), 5),
-                ElementsAre("192.0.2.4", "192.0.2.9", "2001:db8::1", "192.0.2.1", "2001:db8::9"));
+TEST(OwnInterfaces, SevenAddressesComeInAnOrderThatDoesNotDependOnTheSystem) {
+  const LogLines log;
+  host::OwnInterface eth0{"eth0", {}, false, true, {own("fe80::1", true)}};
+  for (const char *text : {"2001:db8::9", "192.0.2.1"}) { /* passing ones */
+    eth0.addresses.push_back(own(text, false, true));
+  }
+  for (const char *text :
+       {"2001:db8::1", "192.0.2.9", "192.0.2.4", "192.0.2.8", "192.0.2.7", "192.0.2.6"}) {
+    eth0.addresses.push_back(own(text));
+  }
+  for (int turn = 1; turn <= 2; turn++) {
+    const auto published = host::publishedAddresses(eth0);
+    EXPECT_THAT(texts(published, published.size()),
+                ElementsAre("192.0.2.4", "192.0.2.6", "192.0.2.7", "192.0.2.8", "192.0.2.9",
+                            "2001:db8::1", "192.0.2.1"));
     std::reverse(eth0.addresses.begin(), eth0.addresses.end());
   }
-}
-
-TEST(OwnInterfaces, AnEighthAddressIsLeftOutAndTheLogSaysSo) {
-  std::vector<std::string> lines;
-  host::setLogSink([&](const host::LogLine &line) { lines.push_back(line.text); }, true);
-  host::OwnInterface eth0{"eth0", {}, false, true, {}};
-  for (int end = 8; end > 0; end--) eth0.addresses.push_back(own("192.0.2." + std::to_string(end)));
-  EXPECT_EQ(host::publishedAddresses(eth0).size(), 7u);
-  host::setLogSink({}, false);
-  EXPECT_THAT(lines, ElementsAre("interface eth0 has 8 addresses: the first 7 are published"));
+  EXPECT_THAT(log.texts,
+              ElementsAre("interface eth0 has 8 addresses: the first 7 are published", _));
 }
 
 TEST(OwnInterfaces, ANodeIsPublishedWithItsInterfacesAndTheirCarriersAsHealth) {

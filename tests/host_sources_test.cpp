@@ -15,6 +15,7 @@
 #include <regex>
 
 #include "host/directory/records.h"
+#include "host/kernel/text.h"
 #include "host/sources/cluster_file_source.h"
 #include "host/sources/machine_uuid.h"
 #include "host/sources/own_interfaces_source.h"
@@ -53,35 +54,55 @@ std::string objects(const std::string &list) {
   return R"({"self":@a9,"nodes":[{"uuid":@a1}],"objects":[)" + list + "]}";
 }
 
-const Entry &find(const std::vector<Entry> &entries, uint8_t type, const zel_UUID &uuid) {
-  const auto found = std::find_if(entries.begin(), entries.end(), [&](const Entry &entry) {
-    return entry.type == type && entry.uuid == uuid;
-  });
-  return found == entries.end() ? throw std::out_of_range("no such entry") : *found;
+/* ---- Entries as text, with the last two digits of their UUIDs --------------------------------- */
+
+std::string endOf(const zel_UUID &uuid) {
+  return toString(uuid).substr(34);
+}
+std::string hexOf(const uint8_t *bytes, size_t size) {
+  std::string text;
+  for (size_t i = 0; i < size; i++) text += host::formatText("%02x", bytes[i]);
+  return text;
+}
+std::string textOf(const uint8_t *address, bool isIPv6) {
+  char text[INET6_ADDRSTRLEN];
+  return inet_ntop(isIPv6 ? AF_INET6 : AF_INET, address, text, sizeof text);
+}
+std::string textOf(const std::vector<KarstIpAddress> &addresses) {
+  std::string text;
+  for (const auto &one : addresses) text += " " + textOf(one.address, one.isIPv6);
+  return text;
 }
 
-template <typename Record>
-Record decoded(const Entry &entry) {
-  Record record{};
-  EXPECT_EQ(host::decode(entry.data, &record), ZEL_OK);
-  return record;
-}
-KarstNetInterfaceEntry interfaceRecord(const std::vector<Entry> &entries, const zel_UUID &uuid) {
-  return decoded<KarstNetInterfaceEntry>(find(entries, KARST_TYPE_NET_INTERFACE, uuid));
-}
-uint32_t healthFlags(const std::vector<Entry> &entries, const zel_UUID &uuid) {
-  return decoded<KarstHealthStatusEntry>(find(entries, KARST_TYPE_HEALTH_STATUS, uuid)).healthFlags;
-}
-
-template <typename Addresses>
-std::vector<std::string> texts(const Addresses &addresses, size_t count) {
-  std::vector<std::string> result;
-  for (size_t i = 0; i < count; i++) {
-    char text[INET6_ADDRSTRLEN];
-    const int family = addresses[i].isIPv6 ? AF_INET6 : AF_INET;
-    result.push_back(inet_ntop(family, addresses[i].address, text, sizeof text));
+std::string shown(const Entry &entry) {
+  const std::string whose = endOf(entry.uuid) + " of " + endOf(entry.owner) + ": ";
+  KarstNodeEntry node;
+  KarstHealthStatusEntry health;
+  KarstNetInterfaceEntry netIf;
+  if (entry.type == KARST_TYPE_NODE && host::decode(entry.data, &node) == ZEL_OK) {
+    return host::formatText("node %s%u.%u flags %u", whose.c_str(), node.majorVersionNum,
+                            node.minorVersionNum, node.flags);
   }
-  return result;
+  if (entry.type == KARST_TYPE_HEALTH_STATUS && host::decode(entry.data, &health) == ZEL_OK) {
+    return "health " + whose + std::to_string(health.healthFlags);
+  }
+  if (entry.type != KARST_TYPE_NET_INTERFACE || host::decode(entry.data, &netIf) != ZEL_OK) {
+    return std::to_string(entry.type) + " " + whose + hexOf(entry.data.data(), entry.data.size());
+  }
+  const std::vector<KarstIpAddress> addresses(netIf.ipAddresses,
+                                              netIf.ipAddresses + netIf.numIpAddresses);
+  return host::formatText(
+      "interface %stype %u, %s,%s, ports %u %u, TTL %u, bandwidth %lu, MAC %s, groups %s %s, "
+      "traffic %lx",
+      whose.c_str(), netIf.networkType, textOf(netIf.ipv4Address, false).c_str(),
+      textOf(addresses).c_str(), netIf.agentGroupPort, netIf.masterGroupPort, netIf.multicastTTL,
+      netIf.bandwidth, hexOf(netIf.macAddress, 6).c_str(), textOf(netIf.agentV6Group, true).c_str(),
+      textOf(netIf.masterV6Group, true).c_str(), netIf.trafficTypeMask);
+}
+std::vector<std::string> shown(const std::vector<Entry> &entries) {
+  std::vector<std::string> texts;
+  for (const Entry &entry : entries) texts.push_back(shown(entry));
+  return texts;
 }
 
 /* ---- The cluster file: what is refused, where, and in which words ---------------------------- */
@@ -155,60 +176,38 @@ TEST(ClusterFile, RefusalsNamePlaceAndRule) {
 
 /* ---- The cluster file: what a good one means ------------------------------------------------- */
 
-TEST(ClusterFile, NodesBecomeEntriesThatOwnThemselves) {
-  const auto content = parse(R"({"$schema":"cluster.schema.json","self":@a2,"nodes":[
-      {"uuid":@a2,"name":"beta","version":{"major":7,"minor":4294967295},"witness":true},
-      {"uuid":@a1}]})");
-  EXPECT_EQ(content.self, uuid("a2"));
-  EXPECT_THAT(content.names, ElementsAre(Pair(uuid("a2"), "beta")));
-  ASSERT_EQ(content.entries.size(), 2u);
-  EXPECT_THAT(decoded<KarstNodeEntry>(content.entries[0]), FieldsAre(0, 0, 0, 0, 0));
-  EXPECT_EQ(content.entries[1].owner, uuid("a2"));
-  EXPECT_THAT(decoded<KarstNodeEntry>(content.entries[1]),
-              FieldsAre(7, 4294967295u, KARST_NODE_FLAG_WITNESS, 0, 0));
+TEST(ClusterFile, EveryFieldOfNodesInterfacesAndObjectsBecomesAnEntryOfItsOwner) {
+  const auto content = parse(R"({"$schema":"cluster.schema.json","self":@a9,"nodes":[
+      {"uuid":@a2,"name":"beta","version":{"major":7,"minor":4294967295},"witness":true,
+       "interfaces":[{"uuid":@b1,
+         "networkType":1, "addresses":["2001:db8::7","192.0.2.7"], "ipv4":"198.51.100.7",
+         "trafficTypes":[0,1,63], "mac":"02:00:5e:10:0a:FF", "bandwidth":9223372036854775807,
+         "agentGroupPort":12345, "masterGroupPort":23451, "multicastTTL":5,
+         "agentV6Group":"ff02::2:3:4", "masterV6Group":"ff02::1:2:3"}]},
+      {"uuid":@a3,"rawRecord":"00fF"},
+      {"uuid":@a1,"interfaces":[{"uuid":@b3,"healthy":false}, {"uuid":@b2,"name":"eth0"},
+        {"uuid":@b4,"healthy":null}, {"uuid":@b5,"healthy":false,"healthFlags":6}]}],
+    "objects":[{"type":255,"uuid":@c1,"owner":@a9,"name":"volume"},
+               {"type":0,"uuid":@c1,"owner":@a1}]})");
+  EXPECT_EQ(content.self, uuid("a9"));
+  EXPECT_THAT(content.names, ElementsAre(Pair(uuid("a2"), "beta"), Pair(uuid("b2"), "eth0"),
+                                         Pair(uuid("c1"), "volume")));
+  const std::string plain =
+      "type 1, 0.0.0.0,, ports 0 0, TTL 0, bandwidth 0, MAC 000000000000, groups :: ::, traffic 0";
+  EXPECT_THAT(
+      shown(content.entries),
+      ElementsAre("0 c1 of a1: ", "node a1 of a1: 0.0 flags 0",
+                  "node a2 of a2: 7.4294967295 flags 2", "3 a3 of a3: 00ff",
+                  "interface b1 of a2: type 1, 198.51.100.7, 2001:db8::7 192.0.2.7, "
+                  "ports 12345 23451, TTL 5, bandwidth 9223372036854775807, MAC 02005e100aff, "
+                  "groups ff02::2:3:4 ff02::1:2:3, traffic 8000000000000003",
+                  "interface b2 of a1: " + plain, "interface b3 of a1: " + plain,
+                  "interface b4 of a1: " + plain, "interface b5 of a1: " + plain,
+                  "health b1 of a2: 0", "health b2 of a1: 0", "health b3 of a1: 1",
+                  "health b5 of a1: 6", "255 c1 of a9: "));
 }
 
-TEST(ClusterFile, EveryFieldOfAnInterfaceReachesItsRecord) {
-  const auto content = parse(interface(R"(
-      "networkType":1, "addresses":["2001:db8::7","192.0.2.7"], "ipv4":"198.51.100.7",
-      "trafficTypes":[0,1,63], "mac":"02:00:5e:10:0a:FF", "bandwidth":9223372036854775807,
-      "agentGroupPort":12345, "masterGroupPort":23451, "multicastTTL":5,
-      "agentV6Group":"ff02::2:3:4", "masterV6Group":"ff02::1:2:3")"));
-  for (const Entry &entry : content.entries) EXPECT_EQ(entry.owner, uuid("a1"));
-  const auto record = interfaceRecord(content.entries, uuid("b1"));
-  EXPECT_THAT(texts(record.ipAddresses, record.numIpAddresses),
-              ElementsAre("2001:db8::7", "192.0.2.7"));
-  EXPECT_THAT(record.ipv4Address, ElementsAre(198, 51, 100, 7));
-  EXPECT_THAT(record.macAddress, ElementsAre(0x02, 0x00, 0x5e, 0x10, 0x0a, 0xff));
-  EXPECT_EQ(std::tuple(record.networkType, record.trafficTypeMask, record.bandwidth,
-                       record.agentGroupPort, record.masterGroupPort, record.multicastTTL,
-                       record.agentV6Group[15], record.masterV6Group[15]),
-            std::tuple(1, 0x8000000000000003, INT64_MAX, 12345, 23451, 5, 4, 3));
-}
-
-TEST(ClusterFile, AnInterfaceIsHealthyForAllTrafficByDefaultElseBadOrUnknown) {
-  const auto record = interfaceRecord(parse(interface(R"("name":"eth0")")).entries, uuid("b1"));
-  EXPECT_EQ(record.networkType, KARST_NETWORK_TYPE_IP);
-  EXPECT_EQ(record.trafficTypeMask, 0u);
-  const auto flags = [](const char *fields) {
-    return healthFlags(parse(interface(fields)).entries, uuid("b1"));
-  };
-  EXPECT_EQ(flags(R"("name":"eth0")"), 0u);
-  EXPECT_EQ(flags(R"("healthy":false)"), 1u);
-  EXPECT_EQ(flags(R"("healthy":false,"healthFlags":6)"), 6u);
-  EXPECT_THROW(flags(R"("healthy":null)"), std::out_of_range);
-}
-
-TEST(ClusterFile, ObjectsMayShareAUUIDAcrossTypesAndBelongToSelf) {
-  const auto content = parse(objects(R"({"type":255,"uuid":@c1,"owner":@a9,"name":"volume"},
-                                        {"type":0,"uuid":@c1,"owner":@a1})"));
-  EXPECT_EQ(find(content.entries, 0, uuid("c1")).owner, uuid("a1"));
-  EXPECT_EQ(find(content.entries, 255, uuid("c1")).owner, uuid("a9"));
-  EXPECT_EQ(content.names.at(uuid("c1")), "volume");
-}
-
-TEST(ClusterFile, RawRecordsAreTakenAsTheyAreAndTheExampleIsGood) {
-  EXPECT_THAT(parse(node(R"("rawRecord":"00fF")")).entries.at(0).data, ElementsAre(0x00, 0xff));
+TEST(ClusterFile, TheExampleIsGoodAndNamesItsNodes) {
   EXPECT_GE(host::parseClusterFile(CLUSTER_EXAMPLE).names.size(), 9u);
 }
 
@@ -265,8 +264,8 @@ class ClusterFileReload : public Test {
       told_.notify_all();
     });
   }
-  uint32_t heldHealth() const {
-    return healthFlags(directory_.entries(KARST_TYPE_HEALTH_STATUS), uuid("b1"));
+  std::string heldHealth() const {
+    return shown(directory_.entries(KARST_TYPE_HEALTH_STATUS).at(0));
   }
 
   const LogLines log_;
@@ -311,7 +310,7 @@ TEST_F(ClusterFileReload, AWatchedFileIsReadHoweverItChangesAndEachRefusalReport
   write(bad_); /* between load and watch */
   watch();
   EXPECT_EQ(next().difference.changed.size(), 1u);
-  EXPECT_EQ(heldHealth(), 1u);
+  EXPECT_EQ(heldHealth(), "health b1 of a1: 1");
 
   write(good_, "new");
   std::filesystem::rename(path("new"), path());
@@ -321,7 +320,7 @@ TEST_F(ClusterFileReload, AWatchedFileIsReadHoweverItChangesAndEachRefusalReport
 
   write("{");
   EXPECT_THAT(next().refusal, HasSubstr("cluster.json:1:2: no valid JSON"));
-  EXPECT_EQ(heldHealth(), 1u);
+  EXPECT_EQ(heldHealth(), "health b1 of a1: 1");
   EXPECT_EQ(source_->content().entries.size(), 3u);
   EXPECT_THROW(source_->load(), host::ClusterFileError);
   write(bad_); /* as before the refusal: good again is news even so */
@@ -329,11 +328,11 @@ TEST_F(ClusterFileReload, AWatchedFileIsReadHoweverItChangesAndEachRefusalReport
 
   std::filesystem::rename(path(), path("aside"));
   EXPECT_THAT(next().refusal, HasSubstr("the file is gone"));
-  EXPECT_EQ(heldHealth(), 1u);
+  EXPECT_EQ(heldHealth(), "health b1 of a1: 1");
   write(good_, "aside");
   std::filesystem::rename(path("aside"), path());
   EXPECT_EQ(next().difference.changed.size(), 1u);
-  EXPECT_EQ(heldHealth(), 0u);
+  EXPECT_EQ(heldHealth(), "health b1 of a1: 0");
 }
 
 TEST_F(ClusterFileReload, AFolderThatCannotBeWatchedIsAnError) {
@@ -380,10 +379,8 @@ TEST(OwnInterfaces, SevenAddressesComeInAnOrderThatDoesNotDependOnTheSystem) {
     eth0.addresses.push_back(own(text));
   }
   for (int turn = 1; turn <= 2; turn++) {
-    const auto published = host::publishedAddresses(eth0);
-    EXPECT_THAT(texts(published, published.size()),
-                ElementsAre("192.0.2.4", "192.0.2.6", "192.0.2.7", "192.0.2.8", "192.0.2.9",
-                            "2001:db8::1", "192.0.2.1"));
+    EXPECT_EQ(textOf(host::publishedAddresses(eth0)),
+              " 192.0.2.4 192.0.2.6 192.0.2.7 192.0.2.8 192.0.2.9 2001:db8::1 192.0.2.1");
     std::reverse(eth0.addresses.begin(), eth0.addresses.end());
   }
   EXPECT_THAT(log.texts,
@@ -397,17 +394,17 @@ TEST(OwnInterfaces, ANodeIsPublishedWithItsInterfacesAndTheirCarriersAsHealth) {
       {"eth1", {2, 0, 0, 0, 0, 2}, false, false, {own("2001:db8::1")}},
       {"eth2", {2, 0, 0, 0, 0, 3}, false, true, {own("fe80::1", true)}}};
   host::OwnNode node{.uuid = uuid("a1"), .majorVersion = 3, .witness = true};
+  const std::string eth0 = endOf(host::namedUUID(node.uuid, "eth0")) + " of a1: ";
+  const std::string eth1 = endOf(host::namedUUID(node.uuid, "eth1")) + " of a1: ";
   const auto entries = host::entriesOf(node, interfaces);
-  ASSERT_EQ(entries.size(), 5u); /* the node, eth0 and eth1 with their healths */
   EXPECT_TRUE(std::is_sorted(entries.begin(), entries.end(), host::comesBefore));
-  for (const Entry &entry : entries) EXPECT_EQ(entry.owner, node.uuid);
-  EXPECT_THAT(decoded<KarstNodeEntry>(entries[0]), FieldsAre(3, 0, KARST_NODE_FLAG_WITNESS, 0, 0));
-  const zel_UUID eth0 = host::namedUUID(node.uuid, "eth0");
-  const auto record = interfaceRecord(entries, eth0);
-  EXPECT_THAT(record.macAddress, ElementsAre(2, 0, 0, 0, 0, 1));
-  EXPECT_THAT(texts(record.ipAddresses, record.numIpAddresses), ElementsAre("192.0.2.1"));
-  EXPECT_EQ(healthFlags(entries, eth0), 0u);
-  EXPECT_NE(healthFlags(entries, host::namedUUID(node.uuid, "eth1")), 0u);
+  const std::string before = ", ports 0 0, TTL 0, bandwidth 0, MAC 02000000000";
+  const std::string behind = ", groups :: ::, traffic 0";
+  EXPECT_THAT(shown(entries),
+              UnorderedElementsAre(
+                  "node a1 of a1: 3.0 flags 2", "health " + eth0 + "0", "health " + eth1 + "1",
+                  "interface " + eth0 + "type 1, 0.0.0.0, 192.0.2.1" + before + "1" + behind,
+                  "interface " + eth1 + "type 1, 0.0.0.0, 2001:db8::1" + before + "2" + behind));
   node.includeLoopback = true;
   EXPECT_EQ(host::entriesOf(node, interfaces).size(), 7u);
 }

@@ -97,7 +97,10 @@ static void judge_calls(const char *expected, int line) {
 
 uint32_t zel_ModuleCurrentID = MODULE_ID;
 static int log_object;
-static int alive; /* blocks, locks and subscriptions */
+static int alive;     /* blocks, locks and subscriptions */
+static uint8_t *base; /* the module in memory */
+static void *cache;   /* with its status callback, as the module registered them */
+static StatusFn status_fn;
 static struct {
   bool woken, stopping;
   uint32_t (*body)(void *);
@@ -106,12 +109,21 @@ static struct {
   sem_t may_run, has_paused;
 } world;
 
+static uint16_t *rank_of(uint64_t lock) {
+  return (uint16_t *)(uintptr_t)lock;
+}
 /* clang-format off */
 #define ALWAYS(type, name, parameters, answer) type name parameters { return answer; }
 #define NOTED(type, name, parameters, answer, ...) \
   type name parameters { called(__VA_ARGS__); return answer; }
 NOTED(void, zel_HeapDestroy, (uint64_t heap), , "HeapDestroy:%" PRIx64, heap)
 NOTED(void, zel_LockDomainDestroy, (uint64_t domain), , "DomainDestroy:%" PRIx64, domain)
+NOTED(void, zel_SpinlockLock, (uint64_t lock), , *rank_of(lock) == 1 ? "c(" : "i(")
+NOTED(void, zel_SpinlockUnlock, (uint64_t lock), , *rank_of(lock) == 1 ? ")c" : ")i")
+NOTED(void, Tolm_LogCleanup, (void **log), , "LogCleanup:%d", *log == &log_object)
+NOTED(void, zel_LogNoLevel, (uint32_t u, const char *format, ...), , "LogNoLevel%u %s", u, format)
+NOTED(void, KARST_DeregisterStatusCallback, (StatusFn fn, void *data), ,
+      "Deregister:%d", fn == status_fn && data == cache)
 NOTED(void, Trace_Notify, (uint64_t handle), , "notify:%" PRIu64, handle)
 NOTED(void, tolmapi_PreemptionEnable, (void), , "preemptible")
 NOTED(bool, tolmapi_PreemptionIsPending, (void), false, "pending?")
@@ -147,9 +159,6 @@ struct block {
   uint64_t size, asker;
   uint8_t content[];
 };
-static uint8_t *base; /* the module in memory */
-static void *cache;   /* as the module registered it */
-
 static struct block *block_of(void *content) {
   return (struct block *)content - 1;
 }
@@ -194,9 +203,6 @@ struct lock_props {
   uint64_t domain;
   uint16_t rank;
 };
-static uint16_t *rank_of(uint64_t lock) {
-  return (uint16_t *)(uintptr_t)lock;
-}
 uint32_t zel_LockDomainCreate(uint32_t module, uint64_t heap, const void *name, uint64_t *domain) {
   called("DomainCreate:%x:%" PRIx64 ":%s", module, heap, (const char *)name);
   *domain = DOMAIN_ID;
@@ -216,12 +222,6 @@ void zel_SpinlockDestroy(uint64_t lock) {
   alive--;
   free(rank_of(lock));
 }
-void zel_SpinlockLock(uint64_t lock) {
-  called(*rank_of(lock) == 1 ? "c(" : "i(");
-}
-void zel_SpinlockUnlock(uint64_t lock) {
-  called(*rank_of(lock) == 1 ? ")c" : ")i");
-}
 
 /* ---- log, text, panic ------------------------------------------------------------------------ */
 
@@ -229,10 +229,6 @@ uint32_t Tolm_LogInit(const char *name, uint32_t module, uint32_t two, uint32_t 
   called("LogInit:%s:%x:%u:%u", name, module, two, zero);
   *log = &log_object;
   return OK;
-}
-void Tolm_LogCleanup(void **log) {
-  CHECK(*log == &log_object);
-  called("LogCleanup");
 }
 /* Noted without the source line. */
 void zel_LogLevel(uint32_t urgency, void *log, int32_t level, const char *format, ...) {
@@ -246,9 +242,6 @@ void zel_LogLevel(uint32_t urgency, void *log, int32_t level, const char *format
   vsnprintf(text, sizeof text, format + strlen(prefix), args);
   va_end(args);
   called("log%u %s: %s: %s", urgency, name, function, text);
-}
-void zel_LogNoLevel(uint32_t urgency, const char *format, ...) {
-  called("LogNoLevel%u %s", urgency, format);
 }
 int zel_Snprintf(char *buffer, size_t size, const char *format, ...) {
   va_list args;
@@ -389,7 +382,6 @@ static struct sub {
   void *data;
   bool ended;
 } subs[SUBS];
-static StatusFn status_fn;
 static const Uuid self_uuid = {{7, 7, 7}};
 static const void *allocator;
 
@@ -404,10 +396,6 @@ uint32_t KARST_RegisterStatusCallback(StatusFn fn, void *data) {
   cache = data;
   called("Register");
   return OK;
-}
-void KARST_DeregisterStatusCallback(StatusFn fn, void *data) {
-  called("Deregister");
-  CHECK(fn == status_fn && data == cache);
 }
 void KARST_GetSelfUUID(void *uuid) {
   called("Self");

@@ -261,8 +261,8 @@ static void disables_and_unloads(void) {
   CHECK_BYTES((void *)netif, "karstrni", 8); /* its subscription's last call is due */
   cleanup_module();
   CALLS(
-      "Deregister c( )c Sleep:100000 c( )c c( )c free free free free free LockDestroy free "
-      "DomainDestroy:10c4 HeapDestroy:7ea9 LogCleanup");
+      "Deregister:1 c( )c Sleep:100000 c( )c c( )c free free free free free LockDestroy free "
+      "DomainDestroy:10c4 HeapDestroy:7ea9 LogCleanup:1");
   CHECK_EQ(alive, 0);
 }
 

@@ -70,22 +70,16 @@ const std::vector<sim::Call> &callsThatCanFail() {
   return calls;
 }
 
-sim::Operation readOperation(Input &input, size_t actors) {
-  sim::Operation operation;
-  operation.phase = input.next() % mostPhases;
-  operation.actor = static_cast<uint8_t>(input.next() % actors);
-  operation.kind = input.next();
-  operation.a = input.next();
-  operation.b = input.next();
-  operation.c = input.next();
-  return operation;
-}
-
 sim::Plan readPlan(Input &input, size_t actors) {
   sim::Plan plan;
   const size_t operations = input.next() % (mostOperations + 1);
   const size_t faults = input.next() % (mostFaults + 1);
-  for (size_t i = 0; i < operations; i++) plan.operations.push_back(readOperation(input, actors));
+  for (size_t i = 0; i < operations; i++) {
+    const auto phase = static_cast<uint8_t>(input.next() % mostPhases);
+    const auto actor = static_cast<uint8_t>(input.next() % actors);
+    plan.operations.push_back(
+        {phase, actor, input.next(), input.next(), input.next(), input.next()});
+  }
   std::stable_sort(plan.operations.begin(), plan.operations.end(),
                    [](const auto &a, const auto &b) { return a.phase < b.phase; });
   for (size_t i = 0; i < faults; i++) {

@@ -256,39 +256,16 @@ TEST_F(DirectoryTest, CancelDropsWhatIsDueAndEndsWithOneLastCall) {
 
 /* ---- Status callbacks ------------------------------------------------------------------------ */
 
-TEST_F(DirectoryTest, UsableAndUnusableAlternate) {
-  put(node, {1});
-  Listener early{directory, {}}, late{directory, {}}, holder{directory, every(node)};
-  early.startStatus();
-  turn({false, true, true}); /* two of them are no turns */
-  late.startStatus();        /* told at once that it is usable already */
-  holder.subscribeHeld();
-  for (const bool isUsable : {false, true, false, true}) directory.setUsable(isUsable);
-  holder.release();
-  directory.waitUntilIdle();
-  early.endStatus();
-  turn({false});
-  EXPECT_EQ(early.events, (Events{"usable", "unusable", "usable"})) << "one interruption";
-  EXPECT_EQ(late.events, (Events{"usable", "unusable", "usable", "unusable"}));
-}
-
-/* A reader that follows the nodes only while it is told that the directory is usable. */
-class DirectoryInterruption : public DirectoryTest {
- protected:
-  void SetUp() override {
-    status.act = [&](const std::string &event, const KarstEntryHeader &) {
-      event == "usable" ? reader.subscribe() : reader.unsubscribe();
-    };
-    status.startStatus();
-  }
-  Events takeReaders() { return std::exchange(reader.events, {}); }
-
-  Listener status{directory, {}}, reader{directory, every(node)}, other{directory, every(node)};
-};
-
-TEST_F(DirectoryInterruption, EndsInWhatWasMissedAndAResync) {
+/* A reader follows the nodes only while it is told that the directory is usable. */
+TEST_F(DirectoryTest, AnInterruptionEndsInWhatWasMissedAndAResync) {
   put(node, {1, 2, 3, 4});
-  Listener later{directory, {}}, single{directory, one(node, 2)};
+  Listener reader{directory, every(node)}, other{directory, every(node)};
+  Listener status{directory, {}}, later{directory, {}}, single{directory, one(node, 2)};
+  const auto takeReaders = [&] { return std::exchange(reader.events, {}); };
+  status.act = [&](const std::string &event, const KarstEntryHeader &) {
+    event == "usable" ? reader.subscribe() : reader.unsubscribe();
+  };
+  status.startStatus();
   later.act = [&](const std::string &, const KarstEntryHeader &) {
     EXPECT_THAT(other.events, Not(Contains("resync"))) << "not all know yet";
     if (later.events.size() != 3) return;
@@ -315,27 +292,6 @@ TEST_F(DirectoryInterruption, EndsInWhatWasMissedAndAResync) {
   status.endStatus();
   turn({false, true});
   EXPECT_EQ(takeReaders(), Events{"resync"}) << "nobody had to be told first";
-}
-
-TEST_F(DirectoryInterruption, KeepsWhatAnInterruptionDropped) {
-  put(node, {1, 2, 3});
-  other.act = [&](const std::string &event, const KarstEntryHeader &) {
-    if (event == "resync" && other.events.size() == 6) directory.setUsable(false);
-  };
-  other.subscribe();
-  directory.waitUntilIdle();
-  reader.holding = true;
-  directory.setUsable(true);
-  reader.reached.wait(); /* in its first call */
-  remove({2, 3});
-  directory.setUsable(false);
-  reader.release();
-  directory.waitUntilIdle();
-  EXPECT_EQ(takeReaders(), (Events{"+1", "cancelled"})) << "before it was told the removals";
-  turn({true}); /* unusable again as soon as that is known, and before the reader was told all */
-  EXPECT_THAT(takeReaders(), Not(Contains("-3")));
-  turn({true});
-  EXPECT_EQ(takeReaders(), (Events{"+2", "-2", "+3", "-3", "+1", "resync"}));
 }
 
 TEST(DirectoryEnd, MakesLastCallsAndReportsWhatIsStillInstalled) {

@@ -19,20 +19,17 @@ struct HeldInstance {
   std::optional<uint32_t> told;
 };
 
-/* A test that made reads fail takes out of a view what the module cannot know. */
 struct DirectoryView {
   struct NetIf {
     KarstNetInterfaceEntry info;
     KarstHealthStatusEntry health; /* all ones: there is no entry */
-    bool subscribed = true;        /* to its health */
   };
   struct Instance {
     HeldInstance held;
     zel_UUID node; /* that it tracks; zero: none */
   };
-  zel_UUID self{};
-  bool witnessHost = false;
-  bool enabled = true; /* else nothing but the nodes that instances are attached to is cached */
+  zel_UUID self;
+  bool witnessHost;
   std::map<zel_UUID, KarstNodeEntry> nodes;              /* those that are reachable */
   std::map<std::pair<zel_UUID, zel_UUID>, NetIf> netIfs; /* by owner and UUID */
   std::vector<Instance> instances;
@@ -48,7 +45,8 @@ DirectoryView viewOf(const host::Directory &directory, const zel_UUID &self, boo
  * nodes and interfaces. True at any time when the cache lock is free and the world waits. */
 std::vector<std::string> damageOf(const KARSTResolverCache *cache);
 
-/* Damage, or else every difference from the view, a line each; none: they are equal. To be asked
- * when nothing is due any more. Needs a directory that fits into the cache's slots. A new version
- * or witness flag of a node alone changes no locators: have each such node marked dirty before. */
+/* Damage, or else every difference of an enabled cache from the view, a line each; none: they are
+ * equal. To be asked when nothing is due any more. Needs a directory that fits into the cache's
+ * slots. A new version or witness flag of a node alone changes no locators: have each such node
+ * marked dirty before. */
 std::vector<std::string> differencesOf(const KARSTResolverCache *cache, const DirectoryView &view);

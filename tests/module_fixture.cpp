@@ -5,13 +5,6 @@
 #include <algorithm>
 #include <regex>
 
-struct ModuleTest::Functions {
-  decltype(KARSTResolver_Create) *create;
-  decltype(KARSTResolver_Destroy) *destroy;
-  decltype(KARSTResolver_SetCallback) *setCallback;
-  decltype(KARSTResolver_GetNodeLocators) *getNodeLocators;
-};
-
 std::vector<std::string> textsOf(const KARSTResolverNodeLocators &set) {
   std::vector<std::string> texts;
   for (uint16_t i = 0; i < set.count; i++) {
@@ -61,12 +54,11 @@ std::string ModuleTest::load(const std::vector<std::string> &parameters) {
   } catch (const host::ModuleError &error) {
     return error.what();
   }
-  functions_ = std::make_unique<Functions>();
-  functions_->create = module_->function<decltype(KARSTResolver_Create)>("KARSTResolver_Create");
-  functions_->destroy = module_->function<decltype(KARSTResolver_Destroy)>("KARSTResolver_Destroy");
-  functions_->setCallback =
+  create_ = module_->function<decltype(KARSTResolver_Create)>("KARSTResolver_Create");
+  destroy_ = module_->function<decltype(KARSTResolver_Destroy)>("KARSTResolver_Destroy");
+  setCallback_ =
       module_->function<decltype(KARSTResolver_SetCallback)>("KARSTResolver_SetCallback");
-  functions_->getNodeLocators =
+  read_ =
       module_->function<decltype(KARSTResolver_GetNodeLocators)>("KARSTResolver_GetNodeLocators");
   return "";
 }
@@ -81,11 +73,6 @@ void ModuleTest::start() {
   directory().setUsable(true);
   ASSERT_EQ(load(), "");
   sim.run();
-}
-
-void ModuleTest::unloadHere() {
-  sim.modules().unload(*module_);
-  module_ = nullptr;
 }
 
 /* ---- Directory ------------------------------------------------------------------------------- */
@@ -144,36 +131,35 @@ void ModuleTest::putSimpleNode(uint32_t number) {
 zel_Status ModuleTest::create(Client &client, const zel_UUID &object, const zel_UUID &node,
                               bool useLocalLocator, uint32_t entryType) {
   return sim.call("client", [&] {
-    return functions_->create(&client.instance, entryType, object, node, useLocalLocator);
+    return create_(&client.instance, entryType, object, node, useLocalLocator);
   });
 }
 
 void ModuleTest::setCallback(Client &client) {
   sim.call("client", [&] {
-    functions_->setCallback(
+    setCallback_(
         client.instance,
         [](void *data, KARSTResolverInstance *instance, uint32_t state) KARST_UNCHECKED {
           auto *told = static_cast<Client *>(data);
           EXPECT_EQ(instance, told->instance);
           told->states.push_back(state);
           told->counts.push_back(instance->locators.count);
-          if (told->duringCallback) told->duringCallback();
         },
         &client);
   });
 }
 
 void ModuleTest::removeCallback(Client &client) {
-  sim.call("client", [&] { functions_->setCallback(client.instance, nullptr, nullptr); });
+  sim.call("client", [&] { setCallback_(client.instance, nullptr, nullptr); });
 }
 
 void ModuleTest::destroy(Client &client) {
-  sim.call("client", [&] { functions_->destroy(client.instance); });
+  sim.call("client", [&] { destroy_(client.instance); });
   client.instance = nullptr;
 }
 
 zel_Status ModuleTest::read(const Client &client, KARSTResolverNodeLocators *set) {
-  return sim.call("client", [&] { return functions_->getNodeLocators(client.instance, set); });
+  return sim.call("client", [&] { return read_(client.instance, set); });
 }
 
 /* ---- Inside ---------------------------------------------------------------------------------- */
@@ -196,34 +182,17 @@ std::vector<KARSTResolverNetIf *> ModuleTest::cachedNetIfs() {
   return found;
 }
 
-size_t ModuleTest::cachedNodes() {
-  return cache()->nodeTree->data->count;
-}
-
-std::vector<host::TracedRecord> ModuleTest::traced(std::initializer_list<uint32_t> ids) {
-  std::vector<host::TracedRecord> found;
-  for (const host::TracedRecord &record : host::readTrace()) {
-    if (record.sequence < traceSeen_) continue;
-    traceSeen_ = record.sequence + 1;
-    if (ids.size() == 0 || std::count(ids.begin(), ids.end(), record.id) != 0) {
-      found.push_back(record);
-    }
-  }
+std::vector<host::TracedRecord> ModuleTest::traced() {
+  std::vector<host::TracedRecord> found = host::readTrace(traceSeen_);
+  if (!found.empty()) traceSeen_ = found.back().sequence + 1;
   return found;
 }
 
-std::vector<uint32_t> ModuleTest::tracedIds(std::initializer_list<uint32_t> ids) {
-  std::vector<uint32_t> found;
-  for (const host::TracedRecord &record : traced(ids)) found.push_back(record.id);
-  return found;
-}
-
-std::vector<std::string> ModuleTest::calls(std::initializer_list<sim::Call> which) {
+std::vector<std::string> ModuleTest::calls(const std::vector<std::string> &which) {
   std::vector<std::string> found;
   for (const sim::HistoryEntry &entry : sim.history()) {
-    if (std::count(which.begin(), which.end(), entry.call) != 0) {
-      found.emplace_back(sim::traits(entry.call).name);
-    }
+    const char *const name = sim::traits(entry.call).name;
+    if (!entry.note && std::count(which.begin(), which.end(), name) != 0) found.emplace_back(name);
   }
   return found;
 }

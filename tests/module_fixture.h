@@ -24,9 +24,8 @@ std::vector<std::string> textsOf(const KARSTResolverNodeLocators &set);
 /* A client: an instance and what its callback was told. */
 struct Client {
   KARSTResolverInstance *instance = nullptr;
-  std::vector<uint32_t> states;         /* one a callback */
-  std::vector<uint16_t> counts;         /* locators of the instance at that moment */
-  std::function<void()> duringCallback; /* runs inside it */
+  std::vector<uint32_t> states; /* one a callback */
+  std::vector<uint16_t> counts; /* locators of the instance at that moment */
 };
 
 class ModuleTest : public ::testing::Test {
@@ -40,7 +39,6 @@ class ModuleTest : public ::testing::Test {
   /* Loads the module (what() of the refusal, empty when it loaded) and unloads it. */
   std::string load(const std::vector<std::string> &parameters = {});
   void unload();
-  void unloadHere(); /* the same, on the fiber that calls it */
 
   /* Loaded, usable, self is node 1, everything taken in. */
   void start();
@@ -82,27 +80,29 @@ class ModuleTest : public ::testing::Test {
   KARSTResolverCache *cache();
   KARSTResolverNode *cachedNode(uint32_t number); /* null: not cached */
   std::vector<KARSTResolverNetIf *> cachedNetIfs();
-  size_t cachedNodes();
   template <typename Function>
   Function *internal(const char *name) {
     return reinterpret_cast<Function *>(module_->anySymbol(name));
   }
 
-  /* Events of the trace since the last call of this, in order; only these ids where given. */
-  std::vector<host::TracedRecord> traced(std::initializer_list<uint32_t> ids = {});
-  std::vector<uint32_t> tracedIds(std::initializer_list<uint32_t> ids = {});
+  /* Events of the trace since the last call of this, in order. */
+  std::vector<host::TracedRecord> traced();
 
-  /* Platform calls by name, with the fiber in front where asked for. */
-  std::vector<std::string> calls(std::initializer_list<sim::Call> which);
+  /* Those of the platform's calls, by name. */
+  std::vector<std::string> calls(const std::vector<std::string> &which);
 
   std::vector<std::string> log; /* the module's lines, with line numbers cut out */
   /* What the host found alive at the end of the module's heap and lock domain. */
   std::vector<std::string> leftBehind;
   sim::Simulation sim;
 
+  /* The module's own, once it is loaded. */
+  decltype(KARSTResolver_Create) *create_ = nullptr;
+  decltype(KARSTResolver_Destroy) *destroy_ = nullptr;
+  decltype(KARSTResolver_SetCallback) *setCallback_ = nullptr;
+  decltype(KARSTResolver_GetNodeLocators) *read_ = nullptr;
+
  private:
-  struct Functions;
-  std::unique_ptr<Functions> functions_;
   host::Module *module_ = nullptr;
   uint64_t traceSeen_ = 0;
 };

@@ -2,122 +2,76 @@
 #include "platform/tolm.h"
 #include "tests/module_fixture.h"
 
-using sim::Call;
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
 
 namespace {
 
-class Load : public ModuleTest {};
+class Load : public ModuleTest {
+ public:
+  explicit Load(const sim::Settings &settings = defaults()) : ModuleTest(settings) {}
+  void TestBody() override {}
+  using ModuleTest::load, ModuleTest::sim;
+
+ protected:
+  zel_HeapID heap() { return host::heapsAlive().at(0); }
+};
 
 TEST_F(Load, BuildsInOrderAndUnloadsInReverse) {
-  const auto life = {Call::Tolm_LogInit,
-                     Call::zel_HeapCreate,
-                     Call::zel_LockDomainCreate,
-                     Call::zel_SpinlockCreate,
-                     Call::KARST_RegisterStatusCallback,
-                     Call::KARST_DeregisterStatusCallback,
-                     Call::zel_SpinlockDestroy,
-                     Call::zel_LockDomainDestroy,
-                     Call::zel_HeapDestroy,
-                     Call::Tolm_LogCleanup};
+  const std::vector<std::string> life = {"Tolm_LogInit",
+                                         "zel_HeapCreate",
+                                         "zel_LockDomainCreate",
+                                         "zel_SpinlockCreate",
+                                         "KARST_RegisterStatusCallback",
+                                         "KARST_DeregisterStatusCallback",
+                                         "zel_SpinlockDestroy",
+                                         "zel_LockDomainDestroy",
+                                         "zel_HeapDestroy",
+                                         "Tolm_LogCleanup"};
   ASSERT_EQ(load(), "");
-  EXPECT_EQ(sim.uses(Call::TokenBucket_InitMini), 19u);
+  EXPECT_EQ(sim.uses(sim::Call::TokenBucket_InitMini), 19u);
   unload();
-  EXPECT_THAT(calls(life),
-              ElementsAre("Tolm_LogInit", "zel_HeapCreate", "zel_LockDomainCreate",
-                          "zel_SpinlockCreate", "KARST_RegisterStatusCallback",
-                          "KARST_DeregisterStatusCallback", "zel_SpinlockDestroy",
-                          "zel_LockDomainDestroy", "zel_HeapDestroy", "Tolm_LogCleanup"));
+  EXPECT_EQ(calls(life), life);
   EXPECT_THAT(sim.alive(), IsEmpty());
 }
 
-TEST_F(Load, SpinlockFailureKeepsItsStatus) {
-  sim.failAt(Call::zel_SpinlockCreate, 1, 1, 0x0bad0999);
+TEST_F(Load, FailsWithTheStatusOfWhatFailed) {
+  sim.failAt(sim::Call::zel_SpinlockCreate, 1, 1, 0x0bad0999);
   EXPECT_NE(load(), "");
   EXPECT_THAT(log, ElementsAre(HasSubstr("Failed to create spinlock: unknown status")));
 }
 
-/* ---- The heap's maximum size ----------------------------------------------------------------- */
-
-uint32_t heapMaximum() {
-  return host::heapState(host::heapsAlive().at(0)).maximum;
-}
-
-class HeapSize : public ModuleTest {
- protected:
-  static sim::Settings associations(uint32_t count) {
-    sim::Settings settings = defaults();
-    settings.maxAssociations = count;
-    return settings;
+/* One instance and its lock for each association and 5 MiB, in 32 bits; at least the parameter. */
+TEST(HeapSize, IsComputedOrTheParameterWhicheverIsMore) {
+  const std::string least = "KARST_RESOLVER_LEAST_MAX_HEAP=";
+  const struct {
+    uint32_t associations;
+    std::vector<std::string> parameters;
+    uint32_t expected, perAssociation;
+  } rows[] = {
+      {0, {}, 0xa00000, 0},
+      {0, {least + "0xa00001"}, 0xa00001, 0},
+      {0, {least + "-1"}, 0xffffffff, 0}, /* a very large unsigned size */
+      {0, {least + "5242880"}, 0x500000, 0},
+      {40000, {least + "1"}, 0x500000, 40000},
+      {0x80000000, {}, 0xa00000, 0}, /* times an even number: nothing, in 32 bits */
+  };
+  for (const auto &row : rows) {
+    sim::Settings settings;
+    settings.maxAssociations = row.associations;
+    Load module(settings);
+    ASSERT_EQ(module.load(row.parameters), "");
+    const uint32_t size = module.sim.call("reader", [] {
+      return tolmapi_HeapRequest2Size(392) + zel_SpinlockAllocSize(ZEL_SPINLOCK_RANKED);
+    });
+    EXPECT_EQ(host::heapState(host::heapsAlive().at(0)).maximum,
+              row.expected + row.perAssociation * size)
+        << row.associations << " associations, " << ::testing::PrintToString(row.parameters);
   }
-  explicit HeapSize(uint32_t count) : ModuleTest(associations(count)) {}
-  static uint32_t perAssociation() {
-    return tolmapi_HeapRequest2Size(392) + zel_SpinlockAllocSize(1);
-  }
-};
-struct HeapSizeNone : HeapSize {
-  HeapSizeNone() : HeapSize(0) {}
-};
-struct HeapSizeMany : HeapSize {
-  HeapSizeMany() : HeapSize(40000) {}
-};
-struct HeapSizeWrapping : HeapSize {
-  HeapSizeWrapping() : HeapSize(0x80000000) {}
-};
-
-TEST_F(HeapSizeNone, DefaultParameterWins) {
-  ASSERT_EQ(load(), "");
-  EXPECT_EQ(heapMaximum(), 0xa00000u);
-}
-
-TEST_F(HeapSizeNone, AnyLargerParameterWins) {
-  ASSERT_EQ(load({"KARST_RESOLVER_LEAST_MAX_HEAP=0xa00001"}), "");
-  EXPECT_EQ(heapMaximum(), 0xa00001u);
-  unload();
-  ASSERT_EQ(load({"KARST_RESOLVER_LEAST_MAX_HEAP=-1"}), "") << "a very large unsigned size";
-  EXPECT_EQ(heapMaximum(), 0xffffffffu);
-  unload();
-  ASSERT_EQ(load({"KARST_RESOLVER_LEAST_MAX_HEAP=5242880"}), "") << "a tie";
-  EXPECT_EQ(heapMaximum(), 0x500000u);
-}
-
-TEST_F(HeapSizeMany, RoomForEachAssociation) {
-  ASSERT_EQ(load({"KARST_RESOLVER_LEAST_MAX_HEAP=1"}), "");
-  EXPECT_EQ(heapMaximum(), sim.call("reader", [] { return 40000 * perAssociation(); }) + 0x500000);
-}
-
-TEST_F(HeapSizeWrapping, ThirtyTwoBits) {
-  ASSERT_EQ(load(), "");
-  uint32_t product = 0x80000000u * sim.call("reader", [] { return perAssociation(); });
-  EXPECT_EQ(heapMaximum(), std::max<uint32_t>(product + 0x500000, 0xa00000));
 }
 
 /* ---- Memory ---------------------------------------------------------------------------------- */
-
-class Memory : public ModuleTest {
- protected:
-  void SetUp() override { ASSERT_EQ(load(), ""); }
-  zel_HeapID heap() { return host::heapsAlive().at(0); }
-};
-
-/* The block stands where a dirty one was. */
-void *dirtied(zel_HeapID heap, uint32_t size) {
-  void *block = host::heapAlloc(heap, size, nullptr);
-  std::memset(block, 0xee, size);
-  host::heapFree(heap, block);
-  return block;
-}
-
-TEST_F(Memory, BlocksAreZeroedOverWhatWasAskedFor) {
-  auto *alloc = internal<void *(uint32_t)>("KARSTResolverAlloc");
-  auto *release = internal<void(void *)>("KARSTResolverFree");
-  dirtied(heap(), 32);
-  auto *block = static_cast<uint8_t *>(sim.call("caller", [&] { return alloc(7); }));
-  for (int i = 0; i < 7; i++) EXPECT_EQ(block[i], 0) << i;
-  sim.call("caller", [&] { release(block); });
-}
 
 struct EntryPoints {
   void *(*alloc)(uint32_t);
@@ -135,23 +89,38 @@ __attribute__((noinline)) void askForBlocks(const EntryPoints &from, void **bloc
   blocks[5] = from.msh->zeroedAlloc(nullptr, 8);
 }
 
-TEST_F(Memory, RecordsTheCallerNotItself) {
-  EntryPoints from{
+TEST_F(Load, BlocksAreZeroedAndNameTheirCallers) {
+  ASSERT_EQ(load(), "");
+  std::vector<std::string> askers;
+  for (const host::HeapBlock &block : host::heapState(heap()).blocks) {
+    const std::string symbol = host::symbolize(block.returnAddress);
+    askers.push_back(symbol.substr(0, symbol.find("+0x")));
+  }
+  EXPECT_THAT(askers, ::testing::IsSupersetOf({std::string("KARSTResolverCacheInit"),
+                                               std::string("KARSTRBTree_CreateTreeData")}));
+  const EntryPoints from{
       internal<void *(uint32_t)>("KARSTResolverAlloc"),
       static_cast<const KARSTMemPool *>(module().anySymbol("karstResolverMemPool")),
       static_cast<const ExprMshAllocator *>(module().anySymbol("resolverMshAlloc")),
   };
-  size_t before = host::heapState(heap()).blocks.size();
+  EXPECT_EQ(from.pool->base, 0u) << "links are plain addresses";
   std::array<void *, 6> blocks;
+  for (void *&block : blocks) { /* these leave their dirt behind */
+    block = host::heapAlloc(heap(), 8, nullptr);
+    std::memset(block, 0xee, 8);
+  }
+  for (void *block : blocks) host::heapFree(heap(), block);
   sim.call("caller", [&] { askForBlocks(from, blocks.data()); });
-  auto recorded = host::heapState(heap()).blocks;
-  recorded.erase(recorded.begin(), recorded.begin() + static_cast<long>(before));
-  ASSERT_EQ(recorded.size(), blocks.size());
+
+  const auto recorded = host::heapState(heap()).blocks;
+  ASSERT_EQ(recorded.size(), askers.size() + blocks.size());
   auto *previous = reinterpret_cast<uint8_t *>(&askForBlocks);
   for (size_t i = 0; i < blocks.size(); i++) {
-    EXPECT_EQ(recorded[i].address, blocks[i]);
-    EXPECT_EQ(recorded[i].size, 8u);
-    auto *address = static_cast<uint8_t *>(recorded[i].returnAddress);
+    const host::HeapBlock &block = recorded[askers.size() + i];
+    EXPECT_EQ(block.address, blocks[i]);
+    EXPECT_EQ(block.size, 8u);
+    EXPECT_EQ(*static_cast<uint64_t *>(block.address), 0u) << i;
+    auto *address = static_cast<uint8_t *>(block.returnAddress);
     EXPECT_GT(address, previous) << "behind the call before, in the function that called";
     EXPECT_LT(address, previous + 512);
     previous = address;
@@ -159,25 +128,11 @@ TEST_F(Memory, RecordsTheCallerNotItself) {
   sim.call("caller", [&] {
     EXPECT_EQ(from.pool->calloc(nullptr, 0x10000, 0x10000), nullptr) << "does not fit in 32 bits";
     for (void *block : blocks) from.msh->free(nullptr, block);
-    from.msh->free(nullptr, nullptr); /* nothing */
+    const uint64_t frees = sim.uses(sim::Call::zel_HeapFree);
+    from.msh->free(nullptr, nullptr);
+    EXPECT_EQ(sim.uses(sim::Call::zel_HeapFree), frees) << "nothing is nothing to free";
   });
-  EXPECT_EQ(host::heapState(heap()).blocks.size(), before);
-}
-
-/* Inside the module: the cache's blocks name the functions that asked. */
-TEST_F(Memory, CachesBlocksNameTheirFunctions) {
-  std::vector<std::string> askers;
-  for (const host::HeapBlock &block : host::heapState(heap()).blocks) {
-    std::string symbol = host::symbolize(block.returnAddress);
-    askers.push_back(symbol.substr(0, symbol.find("+0x")));
-  }
-  EXPECT_THAT(askers, ::testing::IsSupersetOf({std::string("KARSTResolverCacheInit"),
-                                               std::string("KARSTRBTree_CreateTreeData")}));
-}
-
-TEST_F(Memory, ReallocStopsTheSystem) {
-  auto *pool = static_cast<const KARSTMemPool *>(module().anySymbol("karstResolverMemPool"));
-  EXPECT_DEATH(sim.call("caller", [&] { pool->realloc(nullptr, nullptr, 1); }),
+  EXPECT_DEATH(sim.call("caller", [&] { from.pool->realloc(nullptr, nullptr, 1); }),
                "Failed at karst_resolver/karst_resolver_util:[0-9]+ -- NOT REACHED");
 }
 

@@ -1,36 +1,28 @@
-/* Trace emission: selection, throttling with its notices, the record, wall-clock entries. The
- * events themselves are asserted where they happen, in the other module tests. */
+/* Trace emission: every event with its arguments, selection, throttling with its notices, the bits
+ * of a record, wall-clock entries. */
+#include <map>
+#include <set>
+
+#include "host/kernel/text.h"
 #include "tests/module_fixture.h"
 
 using sim::Call;
-using ::testing::Each;
+using ::testing::_;
 using ::testing::ElementsAre;
-using ::testing::IsEmpty;
+using ::testing::SizeIs;
+using ::testing::StartsWith;
 
 namespace {
 
-constexpr uint32_t SET_CALLBACK = 17, INVOKE_CALLBACK = 7;
+constexpr uint32_t SET_CALLBACK = 17, RELEASE = 18;
 
 class Trace : public ModuleTest {
  protected:
-  static sim::Settings throttled(uint64_t perEvent, uint64_t global) {
-    sim::Settings settings = defaults();
-    settings.tracing.throttling = true;
-    settings.tracing.perEventBurst = perEvent;
-    settings.tracing.globalBurst = global;
-    settings.tracing.perEventPerSecond = 1;
-    settings.tracing.globalPerSecond = 1;
-    return settings;
-  }
-  explicit Trace(const sim::Settings &settings = defaults()) : ModuleTest(settings) {}
-
   void SetUp() override {
-    host::setTraceThrottling(false);
     putSimpleNode(1);
     start();
     ASSERT_EQ(createForNode(client_, 1), ZEL_OK);
     traced();
-    host::setTraceThrottling(sim.settings().tracing.throttling);
   }
   void TearDown() override { destroy(client_); }
 
@@ -38,164 +30,234 @@ class Trace : public ModuleTest {
   void emit(unsigned times = 1) {
     for (unsigned i = 0; i < times; i++) removeCallback(client_);
   }
-  uint64_t perEventUses() { return sim.uses(Call::TokenBucket_UseTokensMini); }
-  uint64_t globalUses() { return sim.uses(Call::TokenBucket_UseTokens); }
+  uint64_t bucketsAsked() {
+    return sim.uses(Call::TokenBucket_UseTokensMini) + sim.uses(Call::TokenBucket_UseTokens);
+  }
 
   Client client_;
 };
 
-TEST_F(Trace, ClassLevelSelects) {
-  host::setTraceThrottling(true);
-  host::setTraceClassLevel(37, 1);
-  emit();
-  EXPECT_THAT(traced(), IsEmpty());
-  EXPECT_EQ(perEventUses() + globalUses(), 0u) << "an event that is not selected asks no bucket";
-  host::setTraceClassLevel(37, 2);
-  emit();
-  EXPECT_EQ(traced().size(), 1u);
+/* ---- The events ------------------------------------------------------------------------------ */
+
+/* "id @site" and the payload up to its last word that is not 0. Addresses go by the
+ * order of their appearance, UUIDs as "node #1". */
+class Text {
+ public:
+  std::string of(const host::TracedRecord &record) {
+    std::string text = host::formatText("%u @%u", record.id, record.site);
+    size_t words = record.id == RELEASE ? 2 : std::size(record.payload);
+    while (words > 0 && record.payload[words - 1] == 0) --words;
+    for (size_t i = 0; i < words; i++) text += " " + wordOf(record.payload[i]);
+    return text;
+  }
+
+ private:
+  std::string wordOf(uint64_t word) {
+    if (word == nodeUUID(0).bytes[0]) return "node";
+    if (word == netIfUUID(0).bytes[0]) return "netif";
+    if (word == objectUUID(0).bytes[0]) return "object";
+    if (word << 8 == 0 && word != 0) return host::formatText("#%u", unsigned(word >> 56));
+    if (word < 0x10000) return std::to_string(word);
+    return host::formatText("p%zu", known_.try_emplace(word, known_.size() + 1).first->second);
+  }
+  std::map<uint64_t, size_t> known_;
+};
+
+class Events : public ModuleTest {};
+
+TEST_F(Events, SayWhatHappened) {
+  putObject(1, 1);
+  putHealth(1, 0, 33);
+  putNetIf(1, 1, {"10.0.0.1", "10.0.0.2"});
+  putNode(1);
+  start();
+  Client client;
+  ASSERT_EQ(createForObject(client, 1), ZEL_OK);
+  setCallback(client);
+  putHealth(1, 5, 77);
+  sim.run();
+  directory().remove(objectType, objectUUID(1));
+  sim.run();
+  destroy(client);
+  directory().resync();
+  sim.run();
+  directory().remove(KARST_TYPE_NET_INTERFACE, netIfUUID(1));
+  directory().remove(KARST_TYPE_NODE, nodeUUID(1));
+  sim.run();
+  Text text;
+  std::vector<std::string> texts, releasedFrom;
+  for (const host::TracedRecord &record : traced()) {
+    texts.push_back(text.of(record));
+    if (record.id != RELEASE) continue;
+    releasedFrom.push_back(host::symbolize(reinterpret_cast<void *>(record.payload[2])));
+    EXPECT_NE(record.payload[3], 0u) << "who called that";
+  }
+  const std::vector<std::string> expected = {
+      "12 @454 p1 node #1 1",
+      "14 @50 p1 node #1 1",
+      "8 @150 p2 netif #1 node #1",
+      "10 @304 p2 netif #1 node #1",
+      "14 @578 p1 node #1 1 2",
+      /* the client comes */
+      "1 @485 p3 20 object #1",
+      "4 @315 p3 20 object #1",
+      "3 @220 p3 20 object #1 node #1",
+      "6 @120 p3 object #1 node #1 2",
+      "4 @315 p3 20 object #1 node #1",
+      "17 @621 p3 p4 p5",
+      "7 @39 p3 20 object #1 p4 2",
+      /* the interface fails */
+      "11 @378 p2 netif #1 0 5 77",
+      "14 @578 p1 node #1 1",
+      "6 @120 p3 object #1",
+      "7 @39 p3 20 object #1 p4",
+      "18 @384 p3 3",
+      /* the object goes */
+      "5 @330 p3 20 object #1 node #1",
+      "3 @220 p3 20 object #1",
+      "6 @120 p3 object #1",
+      "7 @39 p3 20 object #1 p4",
+      /* the client goes */
+      "2 @547 p3 20 object #1",
+      "18 @384 p3 2",
+      "18 @384 p3 1",
+      /* the directory starts over, and all goes */
+      "16 @230",
+      "15 @414",
+      "9 @195 p2 netif #1 node #1",
+      "14 @50 p1 node #1",
+      "13 @453 p1 node #1",
+  };
+  EXPECT_EQ(texts, expected);
+  EXPECT_THAT(releasedFrom, ElementsAre(_, StartsWith("KARSTResolver_Destroy"),
+                                        StartsWith("KARSTResolverObjectSubCbk")));
+}
+
+/* ---- Selection ------------------------------------------------------------------------------- */
+
+TEST_F(Trace, IsSelectedByClassLevelAndSwitches) {
+  const struct {
+    const char *name;
+    bool enabled, throttling;
+    int32_t level;
+    uint64_t written, asked;
+  } rows[] = {
+      {"class level too low", true, true, 1, 0, 0},
+      {"stream disabled", false, true, 2, 0, 0},
+      {"throttled", true, true, 2, 60, 120},
+      {"not throttled", true, false, 2, 60, 0},
+  };
+  for (const auto &row : rows) {
+    host::setTraceEnabled(row.enabled);
+    host::setTraceThrottling(row.throttling);
+    host::setTraceClassLevel(37, row.level);
+    const uint64_t before = bucketsAsked();
+    emit(60);
+    EXPECT_THAT(traced(), SizeIs(row.written)) << row.name;
+    EXPECT_EQ(bucketsAsked() - before, row.asked) << row.name;
+  }
+}
+
+TEST_F(Trace, OfANodeThatLeavesIsWrittenAtLevelZero) {
   host::setTraceClassLevel(37, 0);
   directory().remove(KARST_TYPE_NET_INTERFACE, netIfUUID(1));
   directory().remove(KARST_TYPE_NODE, nodeUUID(1));
   sim.run();
-  removeCallback(client_);
   traced();
   destroy(client_);
-  EXPECT_THAT(tracedIds(), ElementsAre(13)) << "a node that leaves is written at level 0";
-  client_ = Client{};
+  const auto records = traced();
+  ASSERT_THAT(records, SizeIs(1));
+  EXPECT_EQ(records[0].id, 13u);
   putSimpleNode(1);
   sim.run();
   ASSERT_EQ(createForNode(client_, 1), ZEL_OK);
 }
 
-TEST_F(Trace, DisabledStreamAsksNoBucket) {
-  host::setTraceThrottling(true);
-  host::setTraceEnabled(false);
-  emit();
-  EXPECT_EQ(perEventUses() + globalUses(), 0u);
-  host::setTraceEnabled(true);
-  EXPECT_THAT(traced(), IsEmpty());
+/* ---- Throttling ------------------------------------------------------------------------------ */
+
+TEST_F(Trace, SaysOnceThatABucketRunsDry) {
+  const uint64_t kind = SET_CALLBACK * 64 + 8;
+  const struct {
+    const char *name;
+    uint64_t perEvent, global;
+    std::vector<uint32_t> sites; /* of the records */
+    uint64_t suppressed;         /* as the last one says */
+    uint64_t globalAsked;
+  } rows[] = {
+      {"the event's bucket", 3, 1000, {621, 621, 407}, kind, 3},
+      {"the stream's bucket", 1000, 3, {621, 621, 430}, 0, 10},
+      {"both: the stream's counts", 2, 2, {621, 430}, 0, 2},
+  };
+  for (const auto &row : rows) {
+    SCOPED_TRACE(row.name);
+    host::TraceSettings settings = sim.settings().tracing;
+    settings.throttling = true;
+    settings.perEventBurst = row.perEvent;
+    settings.globalBurst = row.global;
+    settings.perEventPerSecond = settings.globalPerSecond = 1;
+    host::configureTracing(settings);
+    internal<void()>("KARSTResolverTraceInit")(); /* fills the event's bucket */
+    const uint64_t asked = sim.uses(Call::TokenBucket_UseTokens);
+    emit(10);
+    const std::vector<host::TracedRecord> records = host::readTrace();
+    std::vector<uint32_t> sites;
+    for (const host::TracedRecord &record : records) sites.push_back(record.site);
+    EXPECT_EQ(sites, row.sites);
+    EXPECT_EQ(sim.uses(Call::TokenBucket_UseTokens) - asked, row.globalAsked);
+    const host::TracedRecord &notice = records.back();
+    EXPECT_EQ(notice.type, 9u);
+    EXPECT_EQ(notice.id, row.suppressed ? Trace_GetPerTraceThrottledTraceId()
+                                        : Trace_GetGlobalThrottledTraceId());
+    EXPECT_GT(notice.payload[0], 0u) << "nanoseconds until there is a token";
+    EXPECT_LE(notice.payload[0], 1'000'000'000u);
+    EXPECT_THAT(std::vector(notice.payload + 1, std::end(notice.payload)),
+                ElementsAre(row.suppressed, 0, 0, 0, 0));
+    sim.advance(std::chrono::seconds(3));
+    emit();
+    EXPECT_EQ(host::readTrace().back().site, 621u) << "there are tokens again";
+  }
 }
 
-TEST_F(Trace, UnthrottledWritesEverything) {
-  emit(500);
-  EXPECT_EQ(traced({SET_CALLBACK}).size(), 500u);
-  EXPECT_EQ(perEventUses() + globalUses(), 0u);
-}
+/* ---- The ring -------------------------------------------------------------------------------- */
 
-TEST_F(Trace, RecordCarriesItsFields) {
-  sim.advance(std::chrono::nanoseconds(12345));
-  auto before = static_cast<uint64_t>(sim.now().count());
-  setCallback(client_);
-  auto records = traced();
-  ASSERT_EQ(records.size(), 2u);
-  EXPECT_EQ(records[1].sequence, records[0].sequence + 1);
-  EXPECT_EQ(records[0].type, 8u);
-  EXPECT_EQ(records[0].id, SET_CALLBACK);
-  EXPECT_EQ(records[0].site, 621u);
-  EXPECT_GE(records[0].timeNanoseconds, before);
-  EXPECT_LE(records[0].timeNanoseconds, static_cast<uint64_t>(sim.now().count()));
-  auto instance = reinterpret_cast<uint64_t>(client_.instance);
-  EXPECT_EQ(records[0].payload[0], instance);
-  EXPECT_EQ(records[0].payload[2], reinterpret_cast<uint64_t>(&client_));
-  EXPECT_EQ(records[1].id, INVOKE_CALLBACK);
-  EXPECT_EQ(records[1].site, 39u);
-  EXPECT_THAT(records[1].payload,
-              ElementsAre(instance, objectType, 0, 0, records[0].payload[1], 1));
-  removeCallback(client_);
-}
-
-/* The bits of the ring itself, without the library's reader: phase by lap, sequence, site. */
+/* The bits themselves, without the library's reader. */
 TEST_F(Trace, RingHoldsTheFixedLayoutOverLaps) {
-  host::TraceSettings settings;
+  host::TraceSettings settings = sim.settings().tracing;
   settings.slots = 8;
-  settings.classLevel = 2;
-  settings.throttling = false;
   host::configureTracing(settings);
   auto *stream = static_cast<TraceStream *>(traceStreamTables[1]);
   auto *ring = reinterpret_cast<TraceRecord *>(reinterpret_cast<uint8_t *>(stream) + 128);
+  std::set<uint64_t> processors;
   for (uint64_t sequence = 0; sequence < 40; sequence++) {
+    sim.advance(std::chrono::nanoseconds(12345));
     emit();
     const TraceRecord &record = ring[sequence & 7];
     EXPECT_EQ(record.word0 & 1, 1 - ((sequence >> stream->lapShift) & 1));
+    processors.insert(record.word0 >> 1 & 0xff);
+    EXPECT_EQ(record.word0 >> 9, static_cast<uint64_t>(sim.now().count()));
     EXPECT_EQ(record.word1 & 0x3f, 8u);
     EXPECT_EQ(record.word1 >> 6 & 0x3fff, SET_CALLBACK);
     EXPECT_EQ(record.word1 >> 20 & 0x7fff, 621u);
     EXPECT_EQ(record.word1 >> 35, sequence);
-    EXPECT_THAT((std::array<uint64_t, 3>{record.payload[3], record.payload[4], record.payload[5]}),
-                Each(0));
+    EXPECT_THAT(record.payload,
+                ElementsAre(reinterpret_cast<uint64_t>(client_.instance), 0, 0, 0, 0, 0));
   }
+  EXPECT_THAT(processors, ElementsAre(0, 1, 2, 3, 4, 5, 6, 7)) << "each fiber has another one";
   host::configureTracing(sim.settings().tracing);
 }
 
 TEST_F(Trace, WallClockAndNotificationComeAtTheirIntervals) {
   host::configureTracing(sim.settings().tracing);
-  uint64_t wallClocks = sim.uses(Call::Trace_CreateWallClockEntry);
-  uint64_t notifications = sim.uses(Call::Trace_Notify);
+  const uint64_t wallClocks = sim.uses(Call::Trace_CreateWallClockEntry);
+  const uint64_t notifications = sim.uses(Call::Trace_Notify);
   emit(2049); /* sequence numbers 0 to 2048 */
   EXPECT_EQ(sim.uses(Call::Trace_CreateWallClockEntry) - wallClocks, 2u);
   EXPECT_EQ(sim.uses(Call::Trace_Notify) - notifications, 5u);
-  EXPECT_THAT(host::wallClockEntries(), ::testing::SizeIs(2));
-  auto *stream = static_cast<TraceStream *>(traceStreamTables[1]);
-  stream->notifyHandle = 0;
+  EXPECT_THAT(host::wallClockEntries(), SizeIs(2));
+  static_cast<TraceStream *>(traceStreamTables[1])->notifyHandle = 0;
   emit(2048);
   EXPECT_EQ(sim.uses(Call::Trace_Notify) - notifications, 5u) << "nobody to tell";
   host::configureTracing(sim.settings().tracing);
-}
-
-struct PerEventThrottle : Trace {
-  PerEventThrottle() : Trace(throttled(3, 1000)) {}
-};
-
-TEST_F(PerEventThrottle, LastTokenWritesANoticeThenSilence) {
-  emit(2);
-  EXPECT_EQ(traced({SET_CALLBACK}).size(), 2u);
-  emit(); /* takes the last token */
-  auto notice = traced();
-  ASSERT_EQ(notice.size(), 1u);
-  EXPECT_EQ(notice[0].type, 9u);
-  EXPECT_EQ(notice[0].site, 407u);
-  EXPECT_EQ(notice[0].id, Trace_GetPerTraceThrottledTraceId());
-  EXPECT_GT(notice[0].payload[0], 0u) << "nanoseconds until there is a token";
-  EXPECT_LE(notice[0].payload[0], 1'000'000'000u);
-  EXPECT_EQ(notice[0].payload[1], SET_CALLBACK * 64 + 8);
-  EXPECT_THAT((std::array<uint64_t, 4>{notice[0].payload[2], notice[0].payload[3],
-                                       notice[0].payload[4], notice[0].payload[5]}),
-              Each(0));
-  uint64_t global = globalUses();
-  emit(10);
-  EXPECT_THAT(traced(), IsEmpty());
-  EXPECT_EQ(globalUses(), global) << "a refused event leaves the global bucket alone";
-  sim.advance(std::chrono::seconds(3));
-  emit(2);
-  EXPECT_EQ(traced({SET_CALLBACK}).size(), 2u);
-}
-
-struct GlobalThrottle : Trace {
-  GlobalThrottle() : Trace(throttled(1000, 3)) {}
-};
-
-TEST_F(GlobalThrottle, LastTokenOfTheStreamWritesAGlobalNotice) {
-  emit(5);
-  auto records = traced();
-  ASSERT_EQ(records.size(), 3u);
-  EXPECT_EQ(records[1].type, 8u);
-  EXPECT_EQ(records[2].type, 9u);
-  EXPECT_EQ(records[2].site, 430u);
-  EXPECT_EQ(records[2].id, Trace_GetGlobalThrottledTraceId());
-  EXPECT_GT(records[2].payload[0], 0u);
-  EXPECT_EQ(records[2].payload[1], 0u);
-}
-
-struct BothThrottles : Trace {
-  BothThrottles() : Trace(throttled(2, 2)) {}
-};
-
-TEST_F(BothThrottles, GlobalNoticeWins) {
-  emit(2);
-  auto records = traced();
-  ASSERT_EQ(records.size(), 2u);
-  EXPECT_EQ(records[1].site, 430u);
-  EXPECT_EQ(records[1].payload[1], 0u);
 }
 
 }  // namespace

@@ -66,23 +66,24 @@ class Text {
 class Events : public ModuleTest {};
 
 TEST_F(Events, SayWhatHappened) {
-  putObject(1, 1);
-  putHealth(1, 0, 33);
-  putNetIf(1, 1, {"10.0.0.1", "10.0.0.2"});
   putNode(1);
+  putNode(2);
+  putHealth(2, 0, 33);
+  putNetIf(2, 2, {"10.0.0.1", "10.0.0.2"});
+  putObject(1, 2);
   start();
   Client client;
   ASSERT_EQ(createForObject(client, 1), ZEL_OK);
   setCallback(client);
-  putHealth(1, 5, 77);
+  putHealth(2, 5, 77);
   sim.run();
   directory().remove(objectType, objectUUID(1));
   sim.run();
   destroy(client);
   directory().resync();
   sim.run();
-  directory().remove(KARST_TYPE_NET_INTERFACE, netIfUUID(1));
-  directory().remove(KARST_TYPE_NODE, nodeUUID(1));
+  directory().remove(KARST_TYPE_NET_INTERFACE, netIfUUID(2));
+  directory().remove(KARST_TYPE_NODE, nodeUUID(2));
   sim.run();
   Text text;
   std::vector<std::string> texts, releasedFrom;
@@ -95,38 +96,41 @@ TEST_F(Events, SayWhatHappened) {
   const std::vector<std::string> expected = {
       "12 @454 p1 node #1 1",
       "14 @50 p1 node #1 1",
-      "8 @150 p2 netif #1 node #1",
-      "10 @304 p2 netif #1 node #1",
-      "14 @578 p1 node #1 1 2",
-      /* the client comes */
-      "1 @485 p3 20 object #1",
-      "4 @315 p3 20 object #1",
-      "3 @220 p3 20 object #1 node #1",
-      "6 @120 p3 object #1 node #1 2",
-      "4 @315 p3 20 object #1 node #1",
-      "17 @621 p3 p4 p5",
-      "7 @39 p3 20 object #1 p4 2",
-      /* the interface fails */
-      "11 @378 p2 netif #1 0 5 77",
+      "12 @454 p2 node #2",
+      "8 @150 p3 netif #2 node #2",
+      "10 @304 p3 netif #2 node #2",
+      "14 @50 p2 node #2 1",
       "14 @578 p1 node #1 1",
-      "6 @120 p3 object #1",
-      "7 @39 p3 20 object #1 p4",
-      "18 @384 p3 3",
+      "14 @578 p2 node #2 1 2",
+      /* the client comes */
+      "1 @485 p4 20 object #1",
+      "4 @315 p4 20 object #1",
+      "3 @220 p4 20 object #1 node #2",
+      "6 @120 p4 object #1 node #2 2",
+      "4 @315 p4 20 object #1 node #2",
+      "17 @621 p4 p5 p6",
+      "7 @39 p4 20 object #1 p5 2",
+      /* the interface fails */
+      "11 @378 p3 netif #2 0 5 77",
+      "14 @578 p2 node #2 1",
+      "6 @120 p4 object #1",
+      "7 @39 p4 20 object #1 p5",
+      "18 @384 p4 3",
       /* the object goes */
-      "5 @330 p3 20 object #1 node #1",
-      "3 @220 p3 20 object #1",
-      "6 @120 p3 object #1",
-      "7 @39 p3 20 object #1 p4",
+      "5 @330 p4 20 object #1 node #2",
+      "3 @220 p4 20 object #1",
+      "6 @120 p4 object #1",
+      "7 @39 p4 20 object #1 p5",
       /* the client goes */
-      "2 @547 p3 20 object #1",
-      "18 @384 p3 2",
-      "18 @384 p3 1",
-      /* the directory starts over, and all goes */
+      "2 @547 p4 20 object #1",
+      "18 @384 p4 2",
+      "18 @384 p4 1",
+      /* the directory starts over, and node 2 goes */
       "16 @230",
       "15 @414",
-      "9 @195 p2 netif #1 node #1",
-      "14 @50 p1 node #1",
-      "13 @453 p1 node #1",
+      "9 @195 p3 netif #2 node #2",
+      "14 @50 p2 node #2",
+      "13 @453 p2 node #2",
   };
   EXPECT_EQ(texts, expected);
   EXPECT_THAT(releasedFrom, ElementsAre(_, StartsWith("KARSTResolver_Destroy"),

@@ -18,13 +18,6 @@ void storeByte(void *memory, uint8_t value);
 void fill(void *memory, size_t size);
 void copy(void *to, const void *from, size_t size);
 
-/* `order` as of the compiler's atomic functions. */
-uint64_t atomicLoad(const uint64_t *word, int order);
-void atomicStore(uint64_t *word, uint64_t value, int order);
-uint64_t atomicAdd(uint64_t *word, uint64_t value, int order);
-bool atomicExchangeIf(uint64_t *word, uint64_t expected, uint64_t value, int order);
-void fence(int order);
-
 /* Calls `use` with a word on its own stack. */
 void withLocal(void (*use)(uint64_t *word));
 
@@ -34,3 +27,15 @@ void *allocate(zel_HeapID heap, uint32_t size);
 void storeThrough(uint64_t *word, uint64_t value);
 
 }  // namespace subject
+
+/* What the compiler has instrumented code call for an atomic operation; `order` as of its built-in
+ * functions. NOLINTBEGIN(bugprone-reserved-identifier) */
+extern "C" {
+uint64_t __tsan_atomic64_load(const volatile uint64_t *word, int order);
+void __tsan_atomic64_store(volatile uint64_t *word, uint64_t value, int order);
+uint64_t __tsan_atomic64_fetch_add(volatile uint64_t *word, uint64_t value, int order);
+int __tsan_atomic64_compare_exchange_strong(volatile uint64_t *word, uint64_t *expected,
+                                            uint64_t value, int order, int failureOrder);
+void __tsan_atomic_thread_fence(int order);
+}
+/* NOLINTEND(bugprone-reserved-identifier) */

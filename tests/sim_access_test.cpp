@@ -6,13 +6,12 @@
 
 #include <cstring>
 #include <functional>
-#include <set>
+#include <map>
+#include <mutex>
+#include <sstream>
 #include <string>
-#include <utility>
 #include <vector>
 
-#include "host/kernel/log.h"
-#include "host/kernel/text.h"
 #include "host/threads/sync.h"
 #include "platform/tolm.h"
 #include "sim/access/recorder.h"
@@ -28,30 +27,21 @@ using sim::Simulation;
 using sim::Switching;
 using sim::access::Guard;
 using sim::access::Structure;
+using subject::shared;
 using testing::AllOf;
 using testing::HasSubstr;
 
 using Body = std::function<void()>;
+using Report = testing::Matcher<const std::string &>;
 
-using subject::flag;
-using subject::shared;
+constexpr const char *race = "a race: neither of two accesses happens before the other";
 
-/* Plays the bodies on fibers "a", "b", ... one behind the other, with nothing between them that
- * would make one happen before the next. */
-void play(const std::vector<Body> &bodies) {
-  Machine machine;
-  machine.watch();
-  flag = 0;
-  char name = 'a';
-  for (const Body &body : bodies) machine.spawn(std::string(1, name++), body);
-  machine.run();
+/* In a process of its own: must go through, or else end with such a report. */
+void requireFine(const std::string &what, const Body &program) {
+  EXPECT_EXIT((program(), std::_Exit(0)), testing::ExitedWithCode(0), "") << what;
 }
-
-void put() {
-  subject::store(&shared[0], 1);
-}
-void get() {
-  subject::load(&shared[0]);
+void requireReport(const std::string &what, const Body &program, const Report &report) {
+  EXPECT_DEATH(program(), report) << what;
 }
 
 /* A machine that is watched, with a heap. */
@@ -63,46 +53,93 @@ struct Bench {
 
 /* ---- Races ----------------------------------------------------------------------------------- */
 
-constexpr const char *race = "a race: neither of two accesses happens before the other";
-
-void putAtomically() {
-  subject::atomicStore(&shared[0], 1, __ATOMIC_RELAXED);
+void put() {
+  subject::store(&shared[0], 1);
 }
-void getAtomically() {
-  subject::atomicLoad(&shared[0], __ATOMIC_RELAXED);
+void get() {
+  subject::load(&shared[0]);
+}
+
+/* One word of a program. `put` and `get` touch the first shared word, or the byte that is named;
+ * `fill` touches bytes 4 to 23, `copy` 16 to 18 and then 0 to 2; all else is about the flag. */
+void perform(const std::string &word) {
+  const std::map<std::string, int> orders = {{"relaxed", __ATOMIC_RELAXED},
+                                             {"acquire", __ATOMIC_ACQUIRE},
+                                             {"release", __ATOMIC_RELEASE},
+                                             {"both", __ATOMIC_ACQ_REL},
+                                             {"strong", __ATOMIC_SEQ_CST}};
+  const size_t colon = word.find(':');
+  const std::string what = word.substr(0, colon);
+  const std::string how = colon == std::string::npos ? "" : word.substr(colon + 1);
+  const int order = orders.count(how) != 0 ? orders.at(how) : __ATOMIC_RELAXED;
+  uint64_t number = std::strtoul(how.c_str(), nullptr, 10);
+  auto *bytes = reinterpret_cast<uint8_t *>(shared);
+  if (what == "put" && !how.empty()) return subject::storeByte(bytes + number, 1);
+  if (what == "put") return put();
+  if (what == "get") return get();
+  if (what == "fill") return subject::fill(bytes + 4, 20);
+  if (what == "copy") return subject::copy(bytes, bytes + 16, 3);
+  if (what == "atomic-put") return __tsan_atomic64_store(&shared[0], 1, order);
+  if (what == "atomic-get") return void(__tsan_atomic64_load(&shared[0], order));
+  if (what == "plain-load") return void(subject::load(&subject::flag));
+  if (what == "load") return void(__tsan_atomic64_load(&subject::flag, order));
+  if (what == "store") return __tsan_atomic64_store(&subject::flag, 1, order);
+  if (what == "fence") return __tsan_atomic_thread_fence(order);
+  if (what == "exchange")
+    return void(__tsan_atomic64_compare_exchange_strong(&subject::flag, &number, 7, order, order));
+  const bool countsDown = what == "down"; /* one of two that read; the last one writes */
+  if (countsDown) get();
+  const uint64_t before = __tsan_atomic64_fetch_add(&subject::flag, 1, order);
+  if (countsDown && before % 2 == 1) put();
+}
+
+/* Plays "words of a fiber | words of the next" on fibers "a", "b", ... one behind the other, with
+ * nothing between them that would make one happen before the next. */
+void play(const std::string &program) {
+  Machine machine;
+  machine.watch();
+  subject::flag = 0;
+  std::istringstream fibers(program);
+  char name = 'a';
+  for (std::string fiber; std::getline(fibers, fiber, '|');) {
+    machine.spawn(std::string(1, name++), [fiber] {
+      std::istringstream words(fiber);
+      for (std::string word; words >> word;) perform(word);
+    });
+  }
+  machine.run();
 }
 
 TEST(Race, IsTwoUnorderedAccessesOfWhichOneWritesAndOneIsPlain) {
-  const std::vector<std::pair<Body, Body>> races = {
-      {put, put},           {put, get},           {get, put},
-      {put, putAtomically}, {put, getAtomically}, {get, putAtomically},
-      {putAtomically, put}, {putAtomically, get}, {getAtomically, put}};
-  for (const auto &[first, second] : races) {
-    EXPECT_DEATH(play({first, second}), AllOf(HasSubstr(race), HasSubstr("The earlier one: a "),
-                                              HasSubstr("subject::shared+0x0 in")));
-  }
-  play({get, get});
-  play({getAtomically, get});
-  play({putAtomically, putAtomically, getAtomically});
-  play({[] { put(), get(), put(); }});
-  const auto putAndGet = [] {
-    put();
-    subject::atomicStore(&flag, 1, __ATOMIC_RELEASE);
-    get(); /* does not hide the write from others */
-  };
-  EXPECT_DEATH(play({putAndGet, get}), race);
-}
-
-TEST(Race, IsFoundByTheByte) {
-  auto *bytes = reinterpret_cast<uint8_t *>(shared);
-  const auto writer = [=](size_t byte) { return [=] { subject::storeByte(bytes + byte, 1); }; };
-  play({writer(3), writer(4), writer(8)});
-  play({writer(3), [=] { subject::fill(bytes + 4, 20); }});
-  play({[=] { subject::copy(bytes, bytes + 16, 3); }, writer(3)});
-  EXPECT_DEATH(play({writer(23), [=] { subject::fill(bytes + 4, 20); }}), race);
-  EXPECT_DEATH(play({writer(18), [=] { subject::copy(bytes, bytes + 16, 3); }}), race);
-  EXPECT_DEATH(play({writer(2), [=] { subject::copy(bytes, bytes + 16, 3); }}), race);
-  EXPECT_DEATH(play({writer(5), put}), race);
+  const char *const races[] = {
+      "put | put", "put | get", "get | put", "put | atomic-put", "put | atomic-get",
+      "get | atomic-put", "atomic-put | put", "atomic-put | get", "atomic-get | put",
+      "put store:release get | get", /* the read hides no write */
+      "put:23 | fill", "put:18 | copy", "put:2 | copy", "put:4 | put",
+      "put store:relaxed | load:acquire get", "put store:release | load:relaxed get",
+      /* a store ends a release sequence */
+      "put store:release | store:relaxed | load:acquire get",
+      "put store:release | store:release | load:acquire get",
+      "put store:release | store:relaxed | add:release | load:acquire get",
+      "down:release | down:release", "down:acquire | down:acquire",
+      "put fence:acquire store:relaxed | load:relaxed fence:acquire get",
+      "put fence:release store:relaxed | load:relaxed fence:release get"};
+  const char *const fine[] = {
+      "get | get", "atomic-get | get", "atomic-put | atomic-put | atomic-get", "put get put",
+      "put:3 | put:4 | put:8", "put:3 | fill", "copy | put:3",
+      "put store:release | load:acquire get", "put store:strong | load:strong get",
+      /* updates continue it; an exchange that fails is a read */
+      "put store:release | add:relaxed | exchange:2 | load:acquire get",
+      "put store:release | add:release | load:acquire get",
+      "put store:release | exchange:9 | load:acquire get", "exchange:9 | plain-load",
+      "down:both | down:both", "put fence:release store:relaxed | load:relaxed fence:acquire get"};
+  for (const std::string program : races)
+    requireReport(
+        program, [=] { play(program); }, HasSubstr(race));
+  for (const std::string program : fine) requireFine(program, [=] { play(program); });
+  EXPECT_DEATH(play("put | get"),
+               AllOf(HasSubstr("The earlier one: a writes 8 bytes"), HasSubstr("b reads 8 bytes"),
+                     HasSubstr("subject::shared+0x0 in")));
 }
 
 /* However many readers come behind the one that the writer knows nothing of. */
@@ -125,9 +162,10 @@ TEST(Race, WithAnyOfManyReadersIsFound) {
   };
   for (const int reader : {0, 17, 39}) {
     const std::string name = "reader-" + std::to_string(reader) + "; reads 8 bytes";
-    EXPECT_DEATH(many(reader), AllOf(HasSubstr(race), HasSubstr(name)));
+    requireReport(
+        name, [&] { many(reader); }, AllOf(HasSubstr(race), HasSubstr(name)));
   }
-  many(-1);
+  requireFine("none unknown", [&] { many(-1); });
 }
 
 uint64_t *local; /* on the stack of a function that waits */
@@ -140,56 +178,77 @@ TEST(Race, OnAStackIsFound) {
       zel_WorldSleep(10);
     });
   };
-  EXPECT_DEATH(play({owner, [] { subject::store(local, 2); }}),
-               AllOf(HasSubstr(race), HasSubstr("the stack of a, ")));
-  /* The next fiber of the stack is another matter. */
-  Machine machine;
-  machine.watch();
-  for (int i = 0; i < 3; ++i) {
+  const Body two = [&] {
+    Machine machine;
+    machine.watch();
     machine.spawn("owner", owner);
+    machine.spawn("other", [] { subject::store(local, 2); });
     machine.run();
-  }
+  };
+  requireReport("its owner waits", two, AllOf(HasSubstr(race), HasSubstr("the stack of owner, ")));
+  requireFine("the stack's next fiber", [&] {
+    Machine machine;
+    machine.watch();
+    for (int i = 0; i < 3; ++i) {
+      machine.spawn("owner", owner);
+      machine.run();
+    }
+  });
 }
 
 /* ---- What orders ----------------------------------------------------------------------------- */
 
-TEST(Order, ComesFromALockFromAHandOverAndFromSpawning) {
-  Bench bench;
-  const zel_SpinlockHandle lock = bench.heap.lock("order", 1);
-  const auto locked = [=](const Body &body) {
-    return [=] {
-      zel_SpinlockLock(lock);
-      body();
-      zel_SpinlockUnlock(lock);
-    };
-  };
-  bench.machine.spawn("a", locked(put));
-  bench.machine.spawn("b", locked(get));
-  bench.machine.run();
-  bench.machine.call("c", locked(put));
-  bench.machine.call("d", get); /* c's end, the driver, d's beginning */
-
-  sim::HandOver hand;
-  bench.machine.spawn("giver", [&] {
-    put();
-    hand.give();
-  });
-  bench.machine.spawn("taker", [&] {
-    hand.take();
-    put();
-  });
-  bench.machine.run();
+/* Two fibers, one behind the other. */
+void playTwo(Machine &machine, const Body &first, const Body &second) {
+  machine.spawn("a", first);
+  machine.spawn("b", second);
+  machine.run();
 }
 
-TEST(Order, DoesNotComeFromTheHostsOwnMutexes) {
-  host::Mutex mutex;
-  const auto locked = [&mutex](const Body &body) {
-    return [&mutex, body] {
-      const std::lock_guard guard(mutex);
+template <typename Lock>
+void playLocked(Machine &machine, Lock &lock) {
+  const auto locked = [&](void (*body)()) {
+    return [&lock, body] {
+      const std::lock_guard guard(lock);
       body();
     };
   };
-  EXPECT_DEATH(play({locked(put), locked(get)}), race);
+  playTwo(machine, locked(put), locked(get));
+}
+
+void playSpinlock() {
+  Bench bench;
+  struct {
+    zel_SpinlockHandle handle;
+    void lock() { zel_SpinlockLock(handle); }
+    void unlock() { zel_SpinlockUnlock(handle); }
+  } spinlock{bench.heap.lock("order", 1)};
+  playLocked(bench.machine, spinlock);
+  bench.machine.call("c", [&] {
+    const std::lock_guard guard(spinlock);
+    put();
+  });
+  bench.machine.call("d", get); /* c's end, the driver, d's beginning */
+}
+
+void playMutex() {
+  Bench bench;
+  host::Mutex mutex;
+  playLocked(bench.machine, mutex);
+}
+
+void playHandOver() {
+  Bench bench;
+  sim::HandOver hand;
+  const Body give = [&] {
+    put();
+    hand.give();
+  };
+  const Body take = [&] {
+    hand.take();
+    put();
+  };
+  playTwo(bench.machine, give, take);
 }
 
 /* What two fibers see of a world: its creator and waker, and who ends it. */
@@ -224,12 +283,6 @@ void playWorld(bool wakes, bool readsBeforeTheEnd) {
     TOLM_WorldDestroy(&world);
     subject::load(&shared[3]);
   });
-}
-
-TEST(Order, ComesFromAWorldsCreationItsWakeUpAndItsEnd) {
-  playWorld(true, false);
-  EXPECT_DEATH(playWorld(false, false), race);
-  EXPECT_DEATH(playWorld(true, true), race);
 }
 
 /* A subscription whose calls, and whose last one, touch what others have written. */
@@ -272,14 +325,6 @@ void playSubscription(uint64_t seed, bool before) {
   EXPECT_GE(subscriber.calls, 11);
 }
 
-TEST(Order, ComesFromASubscriptionItsCallsAndItsEnd) {
-  for (uint64_t seed = 1; seed <= 20; ++seed) playSubscription(seed, false);
-  const auto racy = [] {
-    for (uint64_t seed = 1; seed <= 20; ++seed) playSubscription(seed, true);
-  };
-  EXPECT_DEATH(racy(), race);
-}
-
 void statusChanged(void *, uint32_t) {
   subject::load(&shared[0]);
   subject::store(&shared[1], 1);
@@ -302,81 +347,25 @@ void playStatus(bool readsBeforeTheEnd) {
   sim.run();
 }
 
-TEST(Order, ComesFromAStatusCallback) {
-  playStatus(false);
-  EXPECT_DEATH(playStatus(true), race);
-}
-
-/* ---- Atomics --------------------------------------------------------------------------------- */
-
-Body publish(int order) {
-  return [order] {
-    put();
-    subject::atomicStore(&flag, 1, order);
+TEST(Order, ComesFromWhatTheKernelPromisesAndFromNothingElse) {
+  const auto subscription = [](bool before) {
+    for (uint64_t seed = 1; seed <= 20; ++seed) playSubscription(seed, before);
   };
-}
-Body observe(int order) {
-  return [order] {
-    subject::atomicLoad(&flag, order);
-    get();
-  };
-}
-Body add(int order) {
-  return [order] { subject::atomicAdd(&flag, 1, order); };
-}
-
-TEST(Atomics, OrderByReleaseAndAcquire) {
-  play({publish(__ATOMIC_RELEASE), observe(__ATOMIC_ACQUIRE)});
-  play({publish(__ATOMIC_SEQ_CST), observe(__ATOMIC_SEQ_CST)});
-  EXPECT_DEATH(play({publish(__ATOMIC_RELAXED), observe(__ATOMIC_ACQUIRE)}), race);
-  EXPECT_DEATH(play({publish(__ATOMIC_RELEASE), observe(__ATOMIC_RELAXED)}), race);
-}
-
-TEST(Atomics, UpdatesContinueAReleaseSequenceAndStoresBreakIt) {
-  const Body release = publish(__ATOMIC_RELEASE);
-  const Body acquire = observe(__ATOMIC_ACQUIRE);
-  const auto store = [] { subject::atomicStore(&flag, 5, __ATOMIC_RELAXED); };
-  const auto exchange = [](uint64_t expected) {
-    return [expected] { subject::atomicExchangeIf(&flag, expected, 7, __ATOMIC_RELAXED); };
-  };
-  play({release, add(__ATOMIC_RELAXED), exchange(2), acquire});
-  play({release, exchange(0), acquire}); /* fails: a read */
-  EXPECT_DEATH(play({release, store, acquire}), race);
-  const auto another = [] { subject::atomicStore(&flag, 5, __ATOMIC_RELEASE); };
-  EXPECT_DEATH(play({release, another, acquire}), race);
-  EXPECT_DEATH(play({release, store, add(__ATOMIC_RELEASE), acquire}), race);
-}
-
-TEST(Atomics, ACountDownNeedsBothItsHalves) {
-  const auto countDown = [](int order) {
-    return [order] {
-      subject::load(&shared[0]);
-      if (subject::atomicAdd(&flag, 1, order) % 2 == 1) put(); /* the last one of two */
-    };
-  };
-  play({countDown(__ATOMIC_ACQ_REL), countDown(__ATOMIC_ACQ_REL)});
-  EXPECT_DEATH(play({countDown(__ATOMIC_RELEASE), countDown(__ATOMIC_RELEASE)}), race);
-  EXPECT_DEATH(play({countDown(__ATOMIC_ACQUIRE), countDown(__ATOMIC_ACQUIRE)}), race);
-}
-
-TEST(Atomics, FencesOrderWhatIsRelaxed) {
-  const auto put2 = [](int order) {
-    return [order] {
-      put();
-      subject::fence(order);
-      subject::atomicStore(&flag, 1, __ATOMIC_RELAXED);
-    };
-  };
-  const auto get2 = [](int order) {
-    return [order] {
-      subject::atomicLoad(&flag, __ATOMIC_RELAXED);
-      subject::fence(order);
-      get();
-    };
-  };
-  play({put2(__ATOMIC_RELEASE), get2(__ATOMIC_ACQUIRE)});
-  EXPECT_DEATH(play({put2(__ATOMIC_ACQUIRE), get2(__ATOMIC_ACQUIRE)}), race);
-  EXPECT_DEATH(play({put2(__ATOMIC_RELEASE), get2(__ATOMIC_RELEASE)}), race);
+  requireFine("a lock, a fiber's end and beginning", playSpinlock);
+  requireFine("a hand-over", playHandOver);
+  requireFine("a world's creation, its wake-up, its end", [] { playWorld(true, false); });
+  requireFine("a subscription, its calls, its end", [&] { subscription(false); });
+  requireFine("a status callback, its end", [] { playStatus(false); });
+  const Report isRace = HasSubstr(race);
+  requireReport("the host's own mutex", playMutex, isRace);
+  requireReport(
+      "a wake-up before the work", [] { playWorld(false, false); }, isRace);
+  requireReport(
+      "before a world's end", [] { playWorld(true, true); }, isRace);
+  requireReport(
+      "before the last call", [&] { subscription(true); }, isRace);
+  requireReport(
+      "before the end of status calls", [] { playStatus(true); }, isRace);
 }
 
 /* ---- Memory of the heap ---------------------------------------------------------------------- */
@@ -388,17 +377,21 @@ TEST(Memory, IsNotTouchedAfterItsEndNorBesideIt) {
     subject::fill(block, 24);
     subject::storeByte(reinterpret_cast<uint8_t *>(block) + 23, 1);
   });
-  const auto touching = [&](ptrdiff_t byte) {
-    bench.machine.call("toucher",
-                       [&] { subject::loadByte(reinterpret_cast<char *>(block) + byte); });
+  const auto touch = [&](ptrdiff_t byte) {
+    return [&bench, byte, block] {
+      bench.machine.call("toucher", [&] { subject::loadByte((char *)block + byte); });
+    };
   };
-  EXPECT_DEATH(touching(24), "memory is touched that nobody was given");
-  EXPECT_DEATH(touching(-1), "memory is touched that nobody was given");
-  EXPECT_DEATH(touching(1 << 20), "memory of the module heap that was never given");
+  const std::string nobodys = "memory is touched that nobody was given";
+  requireReport("behind it", touch(24), HasSubstr(nobodys));
+  requireReport("in front of it", touch(-1), HasSubstr(nobodys));
+  requireReport("far away", touch(1 << 20),
+                HasSubstr("memory of the module heap that was never given"));
   bench.machine.call("freer", [&] { bench.heap.put(block); });
   for (int i = 0; i < 100; ++i) bench.heap.put(bench.heap.get(24)); /* does not hide it */
-  EXPECT_DEATH(
-      bench.machine.call("toucher", [&] { subject::storeThrough(block, 1); }),
+  requireReport(
+      "after its end",
+      [&] { bench.machine.call("toucher", [&] { subject::storeThrough(block, 1); }); },
       AllOf(HasSubstr("memory is touched that was given back"), HasSubstr("toucher writes 8 bytes"),
             HasSubstr("subject::store(unsigned long*"),
             HasSubstr("subject::storeThrough(unsigned long*"),
@@ -421,8 +414,10 @@ TEST(Memory, IsNotGivenBackWhileSomebodyMayTouchIt) {
     });
     bench.machine.run();
   };
-  playBoth(true);
-  EXPECT_DEATH(playBoth(false), AllOf(HasSubstr(race), HasSubstr("freer gives it back")));
+  requireFine("told", [&] { playBoth(true); });
+  requireReport(
+      "not told", [&] { playBoth(false); },
+      AllOf(HasSubstr(race), HasSubstr("freer gives it back")));
 }
 
 /* More than the arena holds passes through it; what is alive stays. */
@@ -459,6 +454,38 @@ const Structure slotStructure{
     .fields = {
         {0, 8, "tag", Guard::Lock}, {8, 8, "link", Guard::Lock}, {16, 8, "value", Guard::Lock}}};
 
+Body read(uint64_t *field) {
+  return [=] { subject::load(field); };
+}
+Body write(uint64_t *field) {
+  return [=] { subject::store(field, 1); };
+}
+Body filled(void *memory, size_t size) {
+  return [=] { subject::fill(memory, size); };
+}
+
+/* By a fiber that holds these locks. */
+struct Access {
+  std::vector<zel_SpinlockHandle> locks;
+  Body body;
+  const char *report; /* null: it may */
+};
+
+void judge(Machine &machine, const std::vector<Access> &accesses) {
+  for (size_t i = 0; i < accesses.size(); i++) {
+    const auto &[locks, body, report] = accesses[i];
+    const Body program = [&machine, &locks = locks, &body = body] {
+      machine.call("user", [&] {
+        for (const zel_SpinlockHandle lock : locks) zel_SpinlockLock(lock);
+        body();
+        for (const zel_SpinlockHandle lock : locks) zel_SpinlockUnlock(lock);
+      });
+    };
+    const std::string name = "access " + std::to_string(i);
+    report ? requireReport(name, program, testing::ContainsRegex(report)) : program();
+  }
+}
+
 TEST(Rules, KeepFreeSlotsUntouched) {
   Bench bench;
   auto *pool = reinterpret_cast<Slot *>(bench.heap.get(2 * sizeof(Slot)));
@@ -466,26 +493,21 @@ TEST(Rules, KeepFreeSlotsUntouched) {
   std::memcpy(pool[1].tag, "used    ", 8);
   bench.recorder.rules().pool(slotStructure, slots, pool, 2);
   const zel_SpinlockHandle lock = bench.heap.lock("pool", 1);
-  const auto locked = [&](const Body &body) {
-    bench.machine.call("user", [&] {
-      zel_SpinlockLock(lock);
-      body();
-      zel_SpinlockUnlock(lock);
-    });
-  };
-  locked([=] { subject::store(&pool[0].link, 1); });
-  locked([=] { subject::store(&pool[1].value, 1); });
-  EXPECT_DEATH(locked([=] { subject::load(&pool[0].value); }),
-               "Slot number 0 is free: bytes 16 to 23 of it must not be touched");
-  EXPECT_DEATH(locked([=] { subject::fill(&pool[0].tag, 23); }), "Slot number 0 is free");
-  EXPECT_DEATH(locked([=] { subject::fill(&pool[0].value, 16); }), "reaches beyond one Slot");
-  EXPECT_DEATH(bench.machine.call("user", [=] { subject::load(&pool[1].value); }),
-               AllOf(HasSubstr("Slot.value needs the outer lock; the outer lock is \"pool\""),
-                     HasSubstr("user reads 8 bytes"), HasSubstr("holding no lock")));
-  locked([=] {
-    subject::fill(&pool[0], sizeof(Slot));
-    subject::store(&pool[0].value, 1);
-  });
+  judge(
+      bench.machine,
+      {{{lock}, write(&pool[0].link), nullptr},
+       {{lock}, write(&pool[1].value), nullptr},
+       {{lock},
+        read(&pool[0].value),
+        "Slot number 0 is free: bytes 16 to 23 of it must not be touched"},
+       {{lock}, filled(&pool[0].tag, 23), "Slot number 0 is free"},
+       {{lock}, filled(&pool[0].value, 16), "reaches beyond one Slot"},
+       {{},
+        read(&pool[1].value),
+        "Slot.value needs the outer lock; the outer lock is \"pool\"\nuser reads 8 bytes.*holding "
+        "no lock"},
+       {{lock}, filled(&pool[0], sizeof(Slot)), nullptr}, /* in use from here on, by one fiber */
+       {{lock}, write(&pool[0].value), nullptr}});
   bench.heap.put(pool);
 }
 
@@ -522,37 +544,27 @@ TEST(Rules, AskForTheGuardOfAFieldOnceTheObjectIsShared) {
     subject::store(&thing->lock, own);
     subject::store(&thing->undeclared, 1);
   });
-  const auto with = [&](const std::vector<zel_SpinlockHandle> &locks, const Body &body) {
-    bench.machine.call("user", [&] {
-      for (const zel_SpinlockHandle lock : locks) zel_SpinlockLock(lock);
-      body();
-      for (const zel_SpinlockHandle lock : locks) zel_SpinlockUnlock(lock);
-    });
-  };
-  const auto get = [&](uint64_t *field) { return [=] { subject::load(field); }; };
-  const auto put = [&](uint64_t *field) { return [=] { subject::store(field, 1); }; };
   constexpr int relaxed = __ATOMIC_RELAXED;
-
-  with({own}, put(&thing->own));
-  EXPECT_DEATH(with({outer}, get(&thing->own)), "Thing.own needs its own lock");
-  EXPECT_DEATH(with({other}, get(&thing->own)), "Thing.own needs its own lock");
-  with({outer, own}, put(&thing->both));
-  with({own}, get(&thing->both));
-  with({outer}, get(&thing->both));
-  EXPECT_DEATH(with({own}, put(&thing->both)), "Thing.both needs .* to be written");
-  EXPECT_DEATH(with({}, get(&thing->both)), "Thing.both needs .* to be read");
-  with({}, get(&thing->constant));
-  EXPECT_DEATH(with({outer, own}, put(&thing->constant)), "Thing.constant is constant by now");
-  with({}, [=] { subject::atomicAdd(&thing->atomic, 1, relaxed); });
-  EXPECT_DEATH(with({outer, own}, get(&thing->atomic)), "Thing.atomic must be touched atomically");
-  with({}, put(&thing->free));
-  with({}, [=] { subject::atomicLoad(&thing->looked, relaxed); });
-  EXPECT_DEATH(with({}, [=] { subject::atomicStore(&thing->looked, 1, relaxed); }), "Thing.looked");
-  EXPECT_DEATH(with({}, get(&thing->looked)), "Thing.looked needs the outer lock");
-  EXPECT_DEATH(with({outer}, put(&thing->looked)), "Thing.looked .* must be written atomically");
-  EXPECT_DEATH(with({outer, own}, get(&thing->undeclared)), "belongs to no field");
-  with({}, [=] { subject::storeThrough(&thing->own, 1); });
-
+  judge(bench.machine,
+        {{{own}, write(&thing->own), nullptr},
+         {{outer}, read(&thing->own), "Thing.own needs its own lock"},
+         {{other}, read(&thing->own), "Thing.own needs its own lock"},
+         {{outer, own}, write(&thing->both), nullptr},
+         {{own}, read(&thing->both), nullptr},
+         {{outer}, read(&thing->both), nullptr},
+         {{own}, write(&thing->both), "Thing.both needs .* to be written"},
+         {{}, read(&thing->both), "Thing.both needs .* to be read"},
+         {{}, read(&thing->constant), nullptr},
+         {{outer, own}, write(&thing->constant), "Thing.constant is constant by now"},
+         {{}, [=] { __tsan_atomic64_store(&thing->atomic, 1, relaxed); }, nullptr},
+         {{outer, own}, read(&thing->atomic), "Thing.atomic must be touched atomically"},
+         {{}, write(&thing->free), nullptr},
+         {{}, [=] { __tsan_atomic64_load(&thing->looked, relaxed); }, nullptr},
+         {{}, [=] { __tsan_atomic64_store(&thing->looked, 1, relaxed); }, "Thing.looked"},
+         {{}, read(&thing->looked), "Thing.looked needs the outer lock"},
+         {{outer}, write(&thing->looked), "Thing.looked .* must be written atomically"},
+         {{outer, own}, read(&thing->undeclared), "belongs to no field"},
+         {{}, [=] { subject::storeThrough(&thing->own, 1); }, nullptr}});
   bench.heap.put(thing);
 }
 

@@ -56,21 +56,6 @@ NetIfs netIfsOf(const KARSTResolverCache *cache, Lines &lines) {
                                         "interfaces", lines);
 }
 
-Nodes dirtyNodes(const KARSTResolverCache *cache, Lines &lines) {
-  return elementsOf<KARSTResolverNode>(cache->dirtyNodes, offsetof(KARSTResolverNode, dirtyLinks),
-                                       "dirty nodes", lines);
-}
-
-/* Interfaces that are on no list any more, and wait for the last call of their subscription. */
-NetIfs destroyedNetIfs(const KARSTResolverCache *cache) {
-  NetIfs found;
-  for (uint32_t i = 0; i < KARST_RESOLVER_NETIF_POOL_SIZE; i++) {
-    const KARSTResolverNetIf &slot = cache->netIfPool[i];
-    if (isTag(slot.tag, KARST_RESOLVER_TAG_NETIF) && slot.node == nullptr) found.push_back(&slot);
-  }
-  return found;
-}
-
 /* How many black nodes every path below a link passes, and the nodes in order; -1: it is no such
  * tree, or one whose keys are not the nodes' own. */
 int blackHeight(const KARSTRBTree *tree, uint64_t link, uint64_t parent, bool belowRed,
@@ -105,8 +90,6 @@ Nodes nodesOf(const KARSTResolverCache *cache, Lines &lines) {
   return nodes;
 }
 
-/* ---- Damage ---------------------------------------------------------------------------------- */
-
 /* But for the tag and the place on the free list. */
 template <typename Slot>
 bool isEmpty(Slot slot) {
@@ -136,33 +119,6 @@ void checkSlots(const Slot *pool, uint32_t size, const char *tag,
   if (free.size() + used.size() != size) lines.push_back(what + ": some are not in the pool");
 }
 
-void checkNode(const KARSTResolverNode &node, const Nodes &dirty, Lines &lines) {
-  const std::string name = "node " + toString(node.uuid);
-  const NetIfs netIfs = netIfsOf(node, lines);
-  const auto instances = elementsOf<KARSTResolverInstance>(
-      node.instanceList, offsetof(KARSTResolverInstance, nodeLinks), "instances of " + name, lines);
-  const size_t references = node.reachable + netIfs.size() + instances.size();
-  if (node.refCount != references || references == 0) {
-    lines.push_back(
-        formatText("%s: %u references, not %zu", name.c_str(), node.refCount, references));
-  }
-  const auto isMine = [&](const auto *element) { return element->node == &node; };
-  const auto isInstance = [](const auto *one) {
-    return isTag(one->tag, KARST_RESOLVER_TAG_INSTANCE);
-  };
-  if (!std::all_of(netIfs.begin(), netIfs.end(), isMine) ||
-      !std::all_of(instances.begin(), instances.end(), isMine) ||
-      !std::all_of(instances.begin(), instances.end(), isInstance)) {
-    lines.push_back(name + ": what is on its lists belongs elsewhere");
-  }
-  const bool queued = node.dirtyLinks.next != nullptr || node.dirtyLinks.previous != nullptr;
-  if (std::count(dirty.begin(), dirty.end(), &node) != queued) {
-    lines.push_back(name + ": queued otherwise than it says");
-  }
-  if (node.rescanSeen) lines.push_back(name + ": has the mark of a rescan");
-  if (node.locators.capacity != KARST_RESOLVER_MAX_LOCATORS) lines.push_back(name + ": capacity");
-}
-
 /* ---- Pictures -------------------------------------------------------------------------------- */
 
 /* What a client may rely on: of an IPv4 address four bytes count. */
@@ -187,9 +143,12 @@ std::string textOf(const KARSTResolverCache &cache) {
                     toString(cache.selfUUID).c_str());
 }
 
-std::string textOf(const KARSTResolverNode &node) {
-  return formatText("reachable %d, self %d, witness %d, version %u.%u, ", node.reachable,
-                    node.isSelf, node.isWitness, node.majorVersion, node.minorVersion) +
+std::string textOf(const KARSTResolverNode &node, size_t netIfs, size_t instances) {
+  return formatText(
+             "references %u, interfaces %zu, instances %zu, reachable %d, self %d, witness %d, "
+             "mark of a rescan %d, room for %u locators, version %u.%u, ",
+             node.refCount, netIfs, instances, node.reachable, node.isSelf, node.isWitness,
+             node.rescanSeen, node.locators.capacity, node.majorVersion, node.minorVersion) +
          textOf(node.locators);
 }
 
@@ -198,9 +157,11 @@ std::string textOf(const KARSTResolverNetIf &netIf) {
   const auto hashOf = [](const auto &record) {
     return std::hash<std::string_view>()({reinterpret_cast<const char *>(&record), sizeof record});
   };
-  return formatText("record %zx, health record %zx, healthy %d, health subscription %d",
-                    hashOf(netIf.info), hashOf(netIf.health), netIf.healthy,
-                    netIf.healthSubInstalled);
+  return formatText(
+      "references %u, record %zx, health record %zx, healthy %d, health subscription "
+      "%d, mark of a rescan %d",
+      netIf.refCount, hashOf(netIf.info), hashOf(netIf.health), netIf.healthy,
+      netIf.healthSubInstalled, netIf.rescanSeen);
 }
 
 std::string textOf(const KARSTResolverInstance &instance, uint32_t told) {
@@ -221,10 +182,14 @@ std::string netIfName(const zel_UUID &owner, const zel_UUID &uuid) {
 Picture pictureOf(const KARSTResolverCache *cache, const DirectoryView &view, Lines &lines) {
   Picture picture{{"cache", textOf(*cache)}};
   for (const KARSTResolverNode *node : nodesOf(cache, lines)) {
-    picture[nodeName(node->uuid)] = textOf(*node);
+    const auto instances = elementsOf<KARSTResolverInstance>(
+        node->instanceList, offsetof(KARSTResolverInstance, nodeLinks),
+        "instances of " + nodeName(node->uuid), lines);
+    picture[nodeName(node->uuid)] = textOf(*node, netIfsOf(*node, lines).size(), instances.size());
   }
   for (const KARSTResolverNetIf *netIf : netIfsOf(cache, lines)) {
-    picture[netIfName(netIf->node->uuid, netIf->uuid)] = textOf(*netIf);
+    const zel_UUID owner = netIf->node ? netIf->node->uuid : zel_UUID{};
+    picture[netIfName(owner, netIf->uuid)] = textOf(*netIf);
   }
   for (const DirectoryView::Instance &one : view.instances) {
     const KARSTResolverInstance &instance = *one.held.instance;
@@ -260,7 +225,7 @@ class Expected {
       const KARSTResolverInstance instance = of(one);
       picture[instance.name] = textOf(instance, instance.state);
     }
-    for (const zel_UUID &uuid : nodes) picture[nodeName(uuid)] = textOf(node(uuid));
+    for (const zel_UUID &uuid : nodes) picture[nodeName(uuid)] = textOfNode(uuid);
     return picture;
   }
 
@@ -271,14 +236,16 @@ class Expected {
     netIf.health = seen.health;
     netIf.healthy = seen.health.healthFlags == 0;
     netIf.healthSubInstalled = 1;
+    netIf.refCount = 2;
     return netIf;
   }
 
-  KARSTResolverNode node(const zel_UUID &uuid) {
+  std::string textOfNode(const zel_UUID &uuid) {
     const auto cached = cached_.find(uuid);
     KARSTResolverNode node{};
     if (cached != cached_.end()) node = *cached->second;
     node.isSelf = uuid == view_.self;
+    node.rescanSeen = 0;
     const auto found = view_.nodes.find(uuid);
     node.reachable = found != view_.nodes.end();
     if (node.reachable) { /* else it is what it was */
@@ -286,12 +253,17 @@ class Expected {
       node.minorVersion = found->second.minorVersionNum;
       node.isWitness = (found->second.flags & KARST_NODE_FLAG_WITNESS) != 0;
     }
-    if (cached == cached_.end()) return node;
+    const auto netIfs = std::count_if(view_.netIfs.begin(), view_.netIfs.end(),
+                                      [&](const auto &one) { return one.first.first == uuid; });
+    const auto instances = std::count_if(view_.instances.begin(), view_.instances.end(),
+                                         [&](const auto &one) { return one.node == uuid; });
+    node.refCount = static_cast<uint32_t>(node.reachable + netIfs + instances);
     /* A node that nothing but instances hold has a set that nobody sees. */
-    if (node.reachable || !netIfsOf(*cached->second, lines_).empty()) {
+    if (cached != cached_.end() && (node.reachable || netIfs != 0)) {
       node.locators = locatorsOf(*cached->second);
     }
-    return node;
+    node.locators.capacity = KARST_RESOLVER_MAX_LOCATORS;
+    return textOf(node, static_cast<size_t>(netIfs), static_cast<size_t>(instances));
   }
 
   KARSTResolverInstance of(const DirectoryView::Instance &seen) {
@@ -403,50 +375,18 @@ DirectoryView viewOf(const host::Directory &directory, const zel_UUID &self, boo
   return view;
 }
 
-Lines damageOf(const KARSTResolverCache *cache) {
+Lines differencesOf(const KARSTResolverCache *cache, const DirectoryView &view) {
   Lines lines;
-  if (!isTag(cache->tag, KARST_RESOLVER_TAG_CACHE)) lines.push_back("cache: its tag is wrong");
   const Nodes nodes = nodesOf(cache, lines);
-  const Nodes dirty = dirtyNodes(cache, lines);
-  size_t netIfsOfNodes = 0;
-  for (const KARSTResolverNode *node : nodes) {
-    checkNode(*node, dirty, lines);
-    netIfsOfNodes += netIfsOf(*node, lines).size();
-  }
-  if (std::any_of(dirty.begin(), dirty.end(), [&](const KARSTResolverNode *node) {
-        return std::count(nodes.begin(), nodes.end(), node) == 0;
-      })) {
-    lines.push_back("dirty nodes: one is not in the tree");
-  }
+  const NetIfs netIfs = netIfsOf(cache, lines);
   checkSlots(cache->nodePool, KARST_RESOLVER_NODE_POOL_SIZE, KARST_RESOLVER_TAG_NODE,
              {nodes.begin(), nodes.end()}, cache->freeNodes, lines);
+  checkSlots(cache->netIfPool, KARST_RESOLVER_NETIF_POOL_SIZE, KARST_RESOLVER_TAG_NETIF,
+             {netIfs.begin(), netIfs.end()}, cache->freeNetIfs, lines);
+  if (cache->dirtyNodes.next != &cache->dirtyNodes) lines.push_back("dirty nodes");
+  if (!isTag(cache->tag, KARST_RESOLVER_TAG_CACHE)) lines.push_back("cache: its tag is wrong");
+  if (!lines.empty()) return lines; /* what follows relies on it */
 
-  const NetIfs live = netIfsOf(cache, lines);
-  const NetIfs destroyed = destroyedNetIfs(cache);
-  if (netIfsOfNodes != live.size()) lines.push_back("interfaces: one is not on its node's list");
-  for (const KARSTResolverNetIf *netIf : live) {
-    if (netIf->node == nullptr || netIf->rescanSeen ||
-        netIf->refCount != 1u + netIf->healthSubInstalled) {
-      lines.push_back("interface " + toString(netIf->uuid) + ": references, a mark, or no node");
-    }
-  }
-  for (const KARSTResolverNetIf *netIf : destroyed) {
-    if (netIf->refCount != 1 || netIf->healthSubInstalled) {
-      lines.push_back("interface " + toString(netIf->uuid) + ": destroyed, and held");
-    }
-  }
-  std::set<const KARSTResolverNetIf *> used(live.begin(), live.end());
-  used.insert(destroyed.begin(), destroyed.end());
-  checkSlots(cache->netIfPool, KARST_RESOLVER_NETIF_POOL_SIZE, KARST_RESOLVER_TAG_NETIF, used,
-             cache->freeNetIfs, lines);
-  return lines;
-}
-
-Lines differencesOf(const KARSTResolverCache *cache, const DirectoryView &view) {
-  Lines lines = damageOf(cache);
-  if (!lines.empty()) return lines;
-  if (!dirtyNodes(cache, lines).empty()) lines.push_back("dirty nodes");
-  if (!destroyedNetIfs(cache).empty()) lines.push_back("interfaces that wait for a last call");
   Picture found = pictureOf(cache, view, lines);
   for (const auto &[name, text] : Expected(cache, view, lines).picture()) {
     const auto node = found.extract(name);

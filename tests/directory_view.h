@@ -41,12 +41,8 @@ struct DirectoryView {
 DirectoryView viewOf(const host::Directory &directory, const zel_UUID &self, bool witnessHost,
                      const std::vector<HeldInstance> &held = {});
 
-/* What is broken in the cache itself, a line each: tree, lists, slots, tags, reference counts of
- * nodes and interfaces. True at any time when the cache lock is free and the world waits. */
-std::vector<std::string> damageOf(const KARSTResolverCache *cache);
-
-/* Damage, or else every difference of an enabled cache from the view, a line each; none: they are
- * equal. To be asked when nothing is due any more. Needs a directory that fits into the cache's
- * slots. A new version or witness flag of a node alone changes no locators: have each such node
- * marked dirty before. */
+/* What is broken in the cache itself (tree, lists, slots, tags), or else every difference of an
+ * enabled cache from the view, a line each; none: they are equal. To be asked when nothing is due any
+ * more. Needs a directory that fits into the cache's slots. A new version or witness flag of a node
+ * alone changes no locators: have each such node marked dirty before. */
 std::vector<std::string> differencesOf(const KARSTResolverCache *cache, const DirectoryView &view);

@@ -98,30 +98,6 @@ TEST(Seed, DecidesTheCourseAndNothingIsLost) {
   EXPECT_GT(orders.size(), 90u);
 }
 
-TEST(Switching, StepsLeadFromPointToPointAndAnyWaiterMayBeNext) {
-  std::set<std::string> orders;
-  for (uint64_t seed = 1; seed <= 200; ++seed) {
-    Machine machine;
-    SimHeap heap;
-    const zel_SpinlockHandle lock = heap.lock("shared", 1);
-    std::string order;
-    zel_SpinlockLock(lock);
-    for (const char name : {'a', 'b', 'c'}) {
-      machine.spawn(std::string(1, name), [&, name] {
-        zel_SpinlockLock(lock);
-        order += name;
-        zel_SpinlockUnlock(lock);
-      });
-    }
-    EXPECT_TRUE(machine.step(6)) << "each comes to its call and waits in it";
-    machine.setStrategy(std::make_unique<sim::RandomWalk>(seed));
-    zel_SpinlockUnlock(lock);
-    machine.run();
-    orders.insert(order);
-  }
-  EXPECT_EQ(orders.size(), 6u);
-}
-
 /* ---- What must not happen -------------------------------------------------------------------- */
 
 /* Where mistakes are made: on a fiber "culprit", with lock a of rank 1 and b of rank 2. */
@@ -262,12 +238,18 @@ TEST(Holding, KeepsFibersBackAndIsNoDeadlock) {
     const std::lock_guard lock(mutex);
     order += 'w';
   });
+  machine.hold("late");
+  machine.spawn("latecomer", [&] { order += 'l'; });
   machine.run();
   EXPECT_THAT(machine.alive(), ElementsAre("fiber holder: can run (held back)",
-                                           "fiber waiter: waits for a mutex, held by holder"));
-  machine.releaseAll();
+                                           "fiber waiter: waits for a mutex, held by holder",
+                                           "fiber latecomer: can run (held back)"));
+  machine.release("holder");
   machine.run();
   EXPECT_EQ(order, "hw");
+  machine.releaseAll();
+  machine.run();
+  EXPECT_EQ(order, "hwl");
 }
 
 /* ---- Worlds ---------------------------------------------------------------------------------- */
@@ -319,27 +301,25 @@ TEST(World, WaitsNoLongerThanItsTimeOutAndNeverGivesWayTwiceRunning) {
 
 /* ---- Failures on demand ---------------------------------------------------------------------- */
 
+/* Counted from the moment of asking. */
 TEST(Faults, ComeAtExactlyTheUseAsked) {
   Machine machine;
   SimHeap heap;
-  const auto allocate = [&](int times) {
+  const struct {
+    uint64_t nth, count;
+    const char *got;
+  } rows[] = {{3, 1, "++-++"}, {2, 2, "+--++"}, {2, Machine::everyFurther, "+----"}};
+  for (const auto &row : rows) {
+    machine.failAt(Call::zel_HeapAllocWithRA, row.nth, row.count);
     std::string got;
-    for (int i = 0; i < times; ++i) {
-      void *block = zel_HeapAllocWithRA(heap.id, 8, nullptr);
-      zel_HeapFree(heap.id, block);
+    for (int i = 0; i < 5; ++i) {
+      uint64_t *block = heap.get(8);
       got += block ? '+' : '-';
+      heap.put(block);
     }
-    return got;
-  };
-  EXPECT_EQ(allocate(1), "+");
-  machine.failAt(Call::zel_HeapAllocWithRA, 3);
-  EXPECT_EQ(allocate(5), "++-++") << "counted from the moment of asking";
-  machine.failAt(Call::zel_HeapAllocWithRA, 2, 2);
-  EXPECT_EQ(allocate(5), "+--++");
-  machine.failAt(Call::zel_HeapAllocWithRA, 2, Machine::everyFurther);
-  EXPECT_EQ(allocate(4), "+---");
-  machine.clearFaults();
-  EXPECT_EQ(allocate(2), "++");
+    EXPECT_EQ(got, row.got);
+    machine.clearFaults();
+  }
 }
 
 }  // namespace

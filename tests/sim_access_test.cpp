@@ -7,8 +7,8 @@
 #include <cstring>
 #include <functional>
 #include <map>
-#include <mutex>
 #include <sstream>
+#include <stdexcept>
 #include <string>
 #include <vector>
 
@@ -60,55 +60,78 @@ void get() {
   subject::load(&shared[0]);
 }
 
-/* One word of a program. `put` and `get` touch the first shared word, or the byte that is named;
- * `fill` touches bytes 4 to 23, `copy` 16 to 18 and then 0 to 2; all else is about the flag. */
-void perform(const std::string &word) {
-  const std::map<std::string, int> orders = {{"relaxed", __ATOMIC_RELAXED},
-                                             {"acquire", __ATOMIC_ACQUIRE},
-                                             {"release", __ATOMIC_RELEASE},
-                                             {"both", __ATOMIC_ACQ_REL},
-                                             {"strong", __ATOMIC_SEQ_CST}};
-  const size_t colon = word.find(':');
-  const std::string what = word.substr(0, colon);
-  const std::string how = colon == std::string::npos ? "" : word.substr(colon + 1);
-  const int order = orders.count(how) != 0 ? orders.at(how) : __ATOMIC_RELAXED;
-  uint64_t number = std::strtoul(how.c_str(), nullptr, 10);
-  auto *bytes = reinterpret_cast<uint8_t *>(shared);
-  if (what == "put" && !how.empty()) return subject::storeByte(bytes + number, 1);
-  if (what == "put") return put();
-  if (what == "get") return get();
-  if (what == "fill") return subject::fill(bytes + 4, 20);
-  if (what == "copy") return subject::copy(bytes, bytes + 16, 3);
-  if (what == "atomic-put") return __tsan_atomic64_store(&shared[0], 1, order);
-  if (what == "atomic-get") return void(__tsan_atomic64_load(&shared[0], order));
-  if (what == "plain-load") return void(subject::load(&subject::flag));
-  if (what == "load") return void(__tsan_atomic64_load(&subject::flag, order));
-  if (what == "store") return __tsan_atomic64_store(&subject::flag, 1, order);
-  if (what == "fence") return __tsan_atomic_thread_fence(order);
-  if (what == "exchange")
-    return void(__tsan_atomic64_compare_exchange_strong(&subject::flag, &number, 7, order, order));
-  const bool countsDown = what == "down"; /* one of two that read; the last one writes */
-  if (countsDown) get();
-  const uint64_t before = __tsan_atomic64_fetch_add(&subject::flag, 1, order);
-  if (countsDown && before % 2 == 1) put();
-}
-
-/* Plays "words of a fiber | words of the next" on fibers "a", "b", ... one behind the other, with
- * nothing between them that would make one happen before the next. */
-void play(const std::string &program) {
-  Machine machine;
-  machine.watch();
-  subject::flag = 0;
-  std::istringstream fibers(program);
-  char name = 'a';
-  for (std::string fiber; std::getline(fibers, fiber, '|');) {
-    machine.spawn(std::string(1, name++), [fiber] {
-      std::istringstream words(fiber);
-      for (std::string word; words >> word;) perform(word);
-    });
+/* Plays "words of a fiber | words of the next" on fibers "f0", "f1", ... one behind the other, with
+ * nothing between them that would make one happen before the next; `then` at the beginning: called
+ * when those before have ended. */
+class Play {
+ public:
+  explicit Play(const std::string &program) {
+    subject::flag = 0;
+    std::istringstream fibers(program);
+    int number = 0;
+    for (std::string fiber; std::getline(fibers, fiber, '|');) {
+      const std::string name = "f" + std::to_string(number++);
+      const auto body = [this, fiber] {
+        std::istringstream words(fiber);
+        for (std::string word; words >> word;) perform(word);
+      };
+      if (fiber.find("then") != std::string::npos) {
+        bench_.machine.run();
+        bench_.machine.call(name, body);
+      } else {
+        bench_.machine.spawn(name, body);
+      }
+    }
+    bench_.machine.run();
   }
-  machine.run();
-}
+
+ private:
+  /* `put` and `get` touch the first shared word, or the byte that is named; `fill` touches bytes 4
+   * to 23, `copy` 16 to 18 and then 0 to 2; what has an order is about the flag. */
+  void perform(const std::string &word) {
+    const std::map<std::string, int> orders = {{"relaxed", __ATOMIC_RELAXED},
+                                               {"acquire", __ATOMIC_ACQUIRE},
+                                               {"release", __ATOMIC_RELEASE},
+                                               {"both", __ATOMIC_ACQ_REL},
+                                               {"strong", __ATOMIC_SEQ_CST}};
+    const size_t colon = word.find(':');
+    const std::string what = word.substr(0, colon);
+    const std::string how = colon == std::string::npos ? "" : word.substr(colon + 1);
+    const int order = orders.count(how) != 0 ? orders.at(how) : __ATOMIC_RELAXED;
+    uint64_t number = std::strtoul(how.c_str(), nullptr, 10);
+    auto *bytes = reinterpret_cast<uint8_t *>(shared);
+    if (what == "then") return;
+    if (what == "put" && !how.empty()) return subject::storeByte(bytes + number, 1);
+    if (what == "put") return put();
+    if (what == "get") return get();
+    if (what == "fill") return subject::fill(bytes + 4, 20);
+    if (what == "copy") return subject::copy(bytes, bytes + 16, 3);
+    if (what == "lock") return zel_SpinlockLock(lock_);
+    if (what == "unlock") return zel_SpinlockUnlock(lock_);
+    if (what == "mutex") return mutex_.lock();
+    if (what == "no-mutex") return mutex_.unlock();
+    if (what == "give") return hand_.give();
+    if (what == "take") return hand_.take();
+    if (what == "atomic-put") return __tsan_atomic64_store(&shared[0], 1, order);
+    if (what == "atomic-get") return void(__tsan_atomic64_load(&shared[0], order));
+    if (what == "plain-load") return void(subject::load(&subject::flag));
+    if (what == "load") return void(__tsan_atomic64_load(&subject::flag, order));
+    if (what == "store") return __tsan_atomic64_store(&subject::flag, 1, order);
+    if (what == "fence") return __tsan_atomic_thread_fence(order);
+    if (what == "exchange")
+      return void(
+          __tsan_atomic64_compare_exchange_strong(&subject::flag, &number, 7, order, order));
+    if (what != "add" && what != "down") throw std::invalid_argument(word);
+    if (what == "down") get(); /* one of two that read; the last one writes */
+    const uint64_t before = __tsan_atomic64_fetch_add(&subject::flag, 1, order);
+    if (what == "down" && before % 2 == 1) put();
+  }
+
+  Bench bench_;
+  zel_SpinlockHandle lock_ = bench_.heap.lock("order", 1);
+  host::Mutex mutex_;
+  sim::HandOver hand_;
+};
 
 TEST(Race, IsTwoUnorderedAccessesOfWhichOneWritesAndOneIsPlain) {
   const char *const races[] = {
@@ -121,7 +144,9 @@ TEST(Race, IsTwoUnorderedAccessesOfWhichOneWritesAndOneIsPlain) {
       "put store:release | store:relaxed | load:acquire get",
       "put store:release | store:release | load:acquire get",
       "put store:release | store:relaxed | add:release | load:acquire get",
-      "down:release | down:release", "down:acquire | down:acquire",
+      /* the host's own mutex orders nothing */
+      "mutex put no-mutex | mutex get no-mutex", "down:release | down:release",
+      "down:acquire | down:acquire",
       "put fence:acquire store:relaxed | load:relaxed fence:acquire get",
       "put fence:release store:relaxed | load:relaxed fence:release get"};
   const char *const fine[] = {
@@ -132,40 +157,29 @@ TEST(Race, IsTwoUnorderedAccessesOfWhichOneWritesAndOneIsPlain) {
       "put store:release | add:relaxed | exchange:2 | load:acquire get",
       "put store:release | add:release | load:acquire get",
       "put store:release | exchange:9 | load:acquire get", "exchange:9 | plain-load",
-      "down:both | down:both", "put fence:release store:relaxed | load:relaxed fence:acquire get"};
+      "down:both | down:both", "lock put unlock | lock get unlock", "put give | take put",
+      "then put | then get | get", /* a fiber's end, the driver, the next one's beginning */
+      "put fence:release store:relaxed | load:relaxed fence:acquire get"};
   for (const std::string program : races)
     requireReport(
-        program, [=] { play(program); }, HasSubstr(race));
-  for (const std::string program : fine) requireFine(program, [=] { play(program); });
-  EXPECT_DEATH(play("put | get"),
-               AllOf(HasSubstr("The earlier one: a writes 8 bytes"), HasSubstr("b reads 8 bytes"),
+        program, [=] { Play play(program); }, HasSubstr(race));
+  for (const std::string program : fine) requireFine(program, [=] { Play play(program); });
+  EXPECT_DEATH(Play("put | get"),
+               AllOf(HasSubstr("The earlier one: f0 writes 8 bytes"), HasSubstr("f1 reads 8 bytes"),
                      HasSubstr("subject::shared+0x0 in")));
 }
 
 /* However many readers come behind the one that the writer knows nothing of. */
 TEST(Race, WithAnyOfManyReadersIsFound) {
-  const auto many = [](int unknown) {
-    Machine machine;
-    machine.watch();
-    sim::HandOver done;
-    for (int i = 0; i < 40; ++i) {
-      machine.spawn("reader-" + std::to_string(i) + ";", [&done, i, unknown] {
-        get();
-        if (i != unknown) done.give();
-      });
-    }
-    machine.spawn("writer", [&done] {
-      done.take();
-      put();
-    });
-    machine.run();
-  };
-  for (const int reader : {0, 17, 39}) {
-    const std::string name = "reader-" + std::to_string(reader) + "; reads 8 bytes";
-    requireReport(
-        name, [&] { many(reader); }, AllOf(HasSubstr(race), HasSubstr(name)));
+  for (const int unknown : {0, 17, 39, 40}) {
+    std::string program;
+    for (int i = 0; i < 40; ++i) program += i == unknown ? "get | " : "get give | ";
+    program += "take put";
+    const Body body = [=] { Play play(program); };
+    const std::string reader = "f" + std::to_string(unknown) + " reads 8 bytes";
+    unknown == 40 ? requireFine("all known", body)
+                  : requireReport(reader, body, AllOf(HasSubstr(race), HasSubstr(reader)));
   }
-  requireFine("none unknown", [&] { many(-1); });
 }
 
 uint64_t *local; /* on the stack of a function that waits */
@@ -197,59 +211,6 @@ TEST(Race, OnAStackIsFound) {
 }
 
 /* ---- What orders ----------------------------------------------------------------------------- */
-
-/* Two fibers, one behind the other. */
-void playTwo(Machine &machine, const Body &first, const Body &second) {
-  machine.spawn("a", first);
-  machine.spawn("b", second);
-  machine.run();
-}
-
-template <typename Lock>
-void playLocked(Machine &machine, Lock &lock) {
-  const auto locked = [&](void (*body)()) {
-    return [&lock, body] {
-      const std::lock_guard guard(lock);
-      body();
-    };
-  };
-  playTwo(machine, locked(put), locked(get));
-}
-
-void playSpinlock() {
-  Bench bench;
-  struct {
-    zel_SpinlockHandle handle;
-    void lock() { zel_SpinlockLock(handle); }
-    void unlock() { zel_SpinlockUnlock(handle); }
-  } spinlock{bench.heap.lock("order", 1)};
-  playLocked(bench.machine, spinlock);
-  bench.machine.call("c", [&] {
-    const std::lock_guard guard(spinlock);
-    put();
-  });
-  bench.machine.call("d", get); /* c's end, the driver, d's beginning */
-}
-
-void playMutex() {
-  Bench bench;
-  host::Mutex mutex;
-  playLocked(bench.machine, mutex);
-}
-
-void playHandOver() {
-  Bench bench;
-  sim::HandOver hand;
-  const Body give = [&] {
-    put();
-    hand.give();
-  };
-  const Body take = [&] {
-    hand.take();
-    put();
-  };
-  playTwo(bench.machine, give, take);
-}
 
 /* What two fibers see of a world: its creator and waker, and who ends it. */
 void playWorld(bool wakes, bool readsBeforeTheEnd) {
@@ -351,13 +312,10 @@ TEST(Order, ComesFromWhatTheKernelPromisesAndFromNothingElse) {
   const auto subscription = [](bool before) {
     for (uint64_t seed = 1; seed <= 20; ++seed) playSubscription(seed, before);
   };
-  requireFine("a lock, a fiber's end and beginning", playSpinlock);
-  requireFine("a hand-over", playHandOver);
   requireFine("a world's creation, its wake-up, its end", [] { playWorld(true, false); });
   requireFine("a subscription, its calls, its end", [&] { subscription(false); });
   requireFine("a status callback, its end", [] { playStatus(false); });
   const Report isRace = HasSubstr(race);
-  requireReport("the host's own mutex", playMutex, isRace);
   requireReport(
       "a wake-up before the work", [] { playWorld(false, false); }, isRace);
   requireReport(

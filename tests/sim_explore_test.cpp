@@ -375,7 +375,8 @@ Answer command(const std::string &options) {
   return {status, testing::internal::GetCapturedStdout() + errors};
 }
 
-/* The least that fails are three operations, no fault and one preemption. */
+/* The least that fails are three operations, no fault and one preemption. On the way there many plans
+ * with two fail, in another way. */
 TEST(Command, FindsShortensAndRepeats) {
   const std::string mark = "Again:   toys ";
   const std::string least = mark +
@@ -383,8 +384,9 @@ TEST(Command, FindsShortensAndRepeats) {
                             "000000010000.000000010000.000000010000 --schedule [0-9]+:[0-9]+\n";
   std::string options;
   for (const std::string strategy : {"random", "pct:2"}) {
-    const Answer found = command(
-        "--scenario three --runs 500 --length 20 --shorten-runs 3000 --strategy " + strategy);
+    const Answer found =
+        command("--scenario three --runs 500 --length 20 --shorten-runs 3000 --seed 3 --strategy " +
+                strategy);
     EXPECT_EQ(found.status, 1);
     EXPECT_THAT(found.text,
                 testing::AllOf(HasSubstr("Found: three operations, the last one halfway: "),

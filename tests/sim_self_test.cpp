@@ -228,6 +228,8 @@ TEST(Holding, KeepsFibersBackAndIsNoDeadlock) {
   Machine machine;
   host::Mutex mutex;
   std::string order;
+  machine.hold("late");
+  machine.spawn("latecomer", [&] { order += 'l'; });
   machine.spawn("holder", [&] {
     const std::lock_guard lock(mutex);
     machine.hold("holder");
@@ -238,12 +240,10 @@ TEST(Holding, KeepsFibersBackAndIsNoDeadlock) {
     const std::lock_guard lock(mutex);
     order += 'w';
   });
-  machine.hold("late");
-  machine.spawn("latecomer", [&] { order += 'l'; });
   machine.run();
-  EXPECT_THAT(machine.alive(), ElementsAre("fiber holder: can run (held back)",
-                                           "fiber waiter: waits for a mutex, held by holder",
-                                           "fiber latecomer: can run (held back)"));
+  EXPECT_THAT(machine.alive(), ElementsAre("fiber latecomer: can run (held back)",
+                                           "fiber holder: can run (held back)",
+                                           "fiber waiter: waits for a mutex, held by holder"));
   machine.release("holder");
   machine.run();
   EXPECT_EQ(order, "hw");

@@ -41,9 +41,11 @@ std::string inShort(double number) {
   return host::formatText(unit == 0 ? "%.0f%s" : "%.1f%s", number, units[unit]);
 }
 
-double rate(const Figures &figures) {
-  return figures.processorSeconds > 0
-             ? static_cast<double>(figures.steps) / figures.processorSeconds
+/* Steps a second of processor time, of all or of one scenario. */
+template <typename Account>
+double rate(const Account &account) {
+  return account.processorSeconds > 0
+             ? static_cast<double>(account.steps) / account.processorSeconds
              : 0;
 }
 
@@ -389,6 +391,10 @@ void Explorer::summarise() const {
   std::printf("  courses      about %llu different ones\n", wide(figures.courses));
   std::printf("  successions  about %llu of a call directly behind another fiber's\n",
               wide(figures.successions));
+  for (const Share &one : search_.shares())
+    std::printf("  %-14s %7llu runs, %10llu steps, %8llu a second of processor time\n",
+                one.scenario->name().c_str(), static_cast<unsigned long long>(one.runs),
+                static_cast<unsigned long long>(one.steps), wide(rate(one)));
   for (const Exhausted &one : search_.exhausted())
     std::printf("  %s, seed %llu, at most %u preemptions: %llu schedules, %s\n",
                 one.scenario.c_str(), static_cast<unsigned long long>(one.seed), one.preemptions,
@@ -415,9 +421,15 @@ void Explorer::writeJson(const std::optional<Found> &found) const {
       {"checks", figures.checks},
       {"courses", wide(figures.courses)},
       {"successions", wide(figures.successions)},
+      {"scenarios", nlohmann::ordered_json::array()},
       {"exhausted", nlohmann::ordered_json::array()},
       {"failure", nullptr},
   };
+  for (const Share &one : search_.shares())
+    json["scenarios"].push_back({{"scenario", one.scenario->name()},
+                                 {"runs", one.runs},
+                                 {"steps", one.steps},
+                                 {"steps_per_processor_second", rate(one)}});
   for (const Exhausted &one : search_.exhausted())
     json["exhausted"].push_back({{"scenario", one.scenario},
                                  {"seed", one.seed},

@@ -49,6 +49,22 @@ Figures Search::figures() const {
           .successions = board_->successions.count()};
 }
 
+std::vector<Share> Search::shares() const {
+  std::vector<Share> shares;
+  for (size_t i = 0; i < accounts_.size(); ++i) {
+    const Account &account = board_->accounts[i];
+    shares.push_back({accounts_[i], account.runs, account.steps,
+                      static_cast<double>(account.processorNanoseconds) / 1e9});
+  }
+  return shares;
+}
+
+void Search::openAccount(const Scenario &scenario) {
+  if (std::find(accounts_.begin(), accounts_.end(), &scenario) != accounts_.end()) return;
+  if (accounts_.size() == mostScenarios) host::panic("more scenarios than there are accounts");
+  accounts_.push_back(&scenario);
+}
+
 /* ---- Watching over the children -------------------------------------------------------------- */
 
 void Search::begin(const Budget &budget) {
@@ -76,9 +92,15 @@ std::optional<Search::Fallen> Search::watch() {
 }
 
 /* In a child. */
-void Search::count(const Outcome &outcome, Slot &slot) {
-  const uint64_t time = processorNanoseconds();
-  board_->processorNanoseconds += time - slot.processorNanoseconds.exchange(time);
+void Search::count(const Scenario &scenario, const Outcome &outcome, Slot &slot) {
+  const uint64_t now = processorNanoseconds();
+  const uint64_t spent = now - slot.processorNanoseconds.exchange(now);
+  const auto place = std::find(accounts_.begin(), accounts_.end(), &scenario);
+  Account &account = board_->accounts[static_cast<size_t>(place - accounts_.begin())];
+  account.processorNanoseconds += spent;
+  account.steps += outcome.steps;
+  ++account.runs;
+  board_->processorNanoseconds += spent;
   board_->operations += outcome.operations;
   board_->faults += outcome.faults;
   board_->checks += outcome.checks;
@@ -113,12 +135,13 @@ void Search::playRuns(const Chances &chances, uint64_t runs, Slot &slot) {
     const Case played = caseOf(chances, run);
     const Outcome outcome = play(played, playing_);
     if (chances.twice) requireEqual(outcome, play(played, playing_));
-    count(outcome, slot);
+    count(*played.scenario, outcome, slot);
   }
 }
 
 std::optional<Found> Search::byChance(const Chances &chances, const Budget &budget) {
   begin(budget);
+  for (const Scenario *scenario : chances.scenarios) openAccount(*scenario);
   for (unsigned member = 0; member < crew_.jobs(); ++member)
     crew_.start(member, [&, member] { playRuns(chances, budget.runs, board_->slots[member]); });
   const std::optional<Fallen> fallen = watch();
@@ -155,7 +178,7 @@ void Search::playSchedules(const Case &searched, uint32_t share, uint32_t preemp
                                                   .module = playing_.module,
                                                   .strategy = &recorder,
                                                   .historyLength = playing_.historyLength});
-      count(outcome, slot);
+      count(*searched.scenario, outcome, slot);
       if (search.owned()) ++slot.schedules[bound];
     } while (search.advance());
     slot.complete[bound] = true;
@@ -166,6 +189,7 @@ std::optional<Found> Search::exhaust(const Scenario &scenario, uint64_t seed, ui
                                      const Budget &budget) {
   preemptions = std::min(preemptions, mostPreemptions);
   begin(budget);
+  openAccount(scenario);
   Case searched =
       makeCase(scenario, seed, {StrategyName::Kind::Exhaustive, preemptions, 0}, length_);
   for (unsigned member = 0; member < crew_.jobs(); ++member)

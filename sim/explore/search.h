@@ -38,6 +38,14 @@ struct Figures {
   double successions = 0; /* a fiber's call directly behind another's: distinct pairs, about */
 };
 
+/* What one scenario had of it. */
+struct Share {
+  const Scenario *scenario;
+  uint64_t runs = 0;
+  uint64_t steps = 0;
+  double processorSeconds = 0;
+};
+
 /* An exhaustive search of one plan. */
 struct Exhausted {
   std::string scenario;
@@ -81,10 +89,12 @@ class Search {
   StrategyName complete(StrategyName strategy, const Scenario &scenario) const;
 
   Figures figures() const;
+  std::vector<Share> shares() const; /* of the scenarios that were played, in the order of that */
   const std::vector<Exhausted> &exhausted() const { return exhausted_; }
 
  private:
   static constexpr uint32_t mostPreemptions = 8;
+  static constexpr size_t mostScenarios = 64;
 
   /* One member's; the others only read. */
   struct Slot {
@@ -93,10 +103,14 @@ class Search {
     std::array<std::atomic<uint64_t>, mostPreemptions + 1> schedules;
     std::array<std::atomic<bool>, mostPreemptions + 1> complete;
   };
+  struct Account {
+    std::atomic<uint64_t> runs, steps, processorNanoseconds;
+  };
   struct Board {
     std::atomic<uint64_t> next; /* the run that is to be played next */
     std::atomic<uint64_t> runs, steps, operations, faults, checks;
     std::atomic<uint64_t> processorNanoseconds; /* of all children */
+    std::array<Account, mostScenarios> accounts;
     std::array<Slot, 256> slots;
     Sketch courses;
     Sketch successions;
@@ -105,7 +119,8 @@ class Search {
   Case caseOf(const Chances &chances, uint64_t run) const;
   void playRuns(const Chances &chances, uint64_t runs, Slot &slot);
   void playSchedules(const Case &searched, uint32_t share, uint32_t preemptions);
-  void count(const Outcome &outcome, Slot &slot);
+  void count(const Scenario &scenario, const Outcome &outcome, Slot &slot);
+  void openAccount(const Scenario &scenario); /* before it is played */
   void begin(const Budget &budget);
   bool spent() const { return board_->runs >= end_.runs || board_->steps >= end_.steps; }
   struct Fallen {
@@ -121,6 +136,7 @@ class Search {
   Budget end_;
   Shared<Board> board_;
   std::map<const Scenario *, uint32_t> lengths_;
+  std::vector<const Scenario *> accounts_;         /* whose is which on the board */
   std::vector<std::unique_ptr<ScheduleLog>> logs_; /* one a member */
   std::vector<Exhausted> exhausted_;
 };

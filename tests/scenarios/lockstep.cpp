@@ -9,6 +9,7 @@
 
 #include "host/kernel/panic.h"
 #include "host/kernel/uuid.h"
+#include "sim/access/access.h"
 #include "tests/scenarios/guards.h"
 
 namespace {
@@ -47,6 +48,24 @@ void requireSections(unsigned sections, unsigned wanted) {
   if (sections == wanted) return;
   host::panic("lockstep: a callback has passed through %u critical sections, not %u", sections,
               wanted);
+}
+
+bool isTagged(const KARSTResolverNode &node) {
+  return std::memcmp(node.tag, KARST_RESOLVER_TAG_NODE, sizeof node.tag) == 0;
+}
+
+/* A list begins and ends with those that it should. `links`: where an element has its own. */
+template <typename Real, typename Wanted>
+void requireEnds(const Wanted &wanted, const KARSTResolverLink &head, size_t links,
+                 const char *what) {
+  const auto is = [&](const KARSTResolverLink *link, const auto *element) {
+    const auto *bytes = reinterpret_cast<const uint8_t *>(link) - links;
+    return link != &head && reinterpret_cast<const Real *>(bytes)->uuid == element->uuid;
+  };
+  if (wanted.empty() ? head.next == &head
+                     : is(head.next, wanted.front()) && is(head.previous, wanted.back()))
+    return;
+  host::panic("lockstep: another %s than it should is the first or last one", what);
 }
 
 size_t lengthOf(const KARSTResolverLink &head) {
@@ -310,7 +329,7 @@ void Lockstep::unlocking(sim::Fiber &fiber, const sim::Spinlock &lock) {
     host::panic("lockstep: %s asked for more than it needs", fiber.name().c_str());
   answersGrew();
   for (Activity &other : activities_) look(other);
-  compare();
+  compareSection();
 }
 
 void Lockstep::step(Activity &activity) {
@@ -432,13 +451,43 @@ void Lockstep::answersGrew() {
 
 /* ---- Comparison ------------------------------------------------------------------------------ */
 
-void Lockstep::compare() {
+/* Where every access is watched, everything after each section. Else what the section has touched,
+ * and the rest at every few sections: what was written to where it does not belong is found a little
+ * later, and many more sections are played. */
+void Lockstep::compareSection() {
+  constexpr uint64_t betweenWhole = 16;
+  constexpr size_t mostTouched = 32; /* by a rescan, say, which looks at nearly all */
   ++checks_;
+  const size_t touched = model_->touchedNodes.size() + model_->touchedNetIfs.size();
+  if (sim::access::watching || sections_ % betweenWhole == 0 || touched > mostTouched) {
+    compareWhole();
+  } else {
+    compareTouched();
+  }
+  model_->touchedNodes.clear();
+  model_->touchedNetIfs.clear();
+}
+
+/* With the lists that they are on: of the long ones, which all share, both ends. */
+void Lockstep::compareTouched() {
+  const zel_UUID cache{};
+  require<int>(cache_->enabled, model_->enabled, "enabled", cache);
+  require<size_t>(cache_->nodeTree->data->count, model_->nodes.size(), "nodes", cache);
+  for (model::Node *node : model_->touchedNodes) compareNode(*node, realOf(*node));
+  for (model::NetIf *netIf : model_->touchedNetIfs)
+    if (netIf->node) compareNetIf(*netIf, realOf(*netIf));
+  requireEnds<KARSTResolverNetIf>(model_->netIfs, cache_->netIfs,
+                                  offsetof(KARSTResolverNetIf, cacheLinks), "interface");
+  requireEnds<KARSTResolverNode>(model_->dirty, cache_->dirtyNodes,
+                                 offsetof(KARSTResolverNode, dirtyLinks), "dirty node");
+}
+
+void Lockstep::compareWhole() {
   const zel_UUID cache{};
   require<int>(cache_->enabled, model_->enabled, "enabled", cache);
   size_t inUse = 0;
   for (const KARSTResolverNode &real : std::span(cache_->nodePool, KARST_RESOLVER_NODE_POOL_SIZE)) {
-    if (std::memcmp(real.tag, KARST_RESOLVER_TAG_NODE, sizeof real.tag) != 0) continue;
+    if (!isTagged(real)) continue;
     ++inUse;
     const auto found = model_->nodes.find(real.uuid);
     if (found == model_->nodes.end())
@@ -468,13 +517,36 @@ void Lockstep::compare() {
     host::panic("lockstep: node %s should be in the dirty queue", name((*dirty)->uuid).c_str());
 }
 
-void Lockstep::compareNode(const model::Node &node, const KARSTResolverNode &real) {
+/* A new one is looked for: any slot may be its. */
+const KARSTResolverNode &Lockstep::realOf(const model::Node &node) const {
+  if (node.slot) return *static_cast<const KARSTResolverNode *>(node.slot);
+  for (const KARSTResolverNode &real : std::span(cache_->nodePool, KARST_RESOLVER_NODE_POOL_SIZE))
+    if (real.uuid == node.uuid && isTagged(real)) return real;
+  host::panic("lockstep: node %s is not cached and should be", name(node.uuid).c_str());
+}
+
+/* A new one stands at the end. */
+const KARSTResolverNetIf &Lockstep::realOf(const model::NetIf &netIf) const {
+  if (netIf.slot) return *static_cast<const KARSTResolverNetIf *>(netIf.slot);
+  for (const KARSTResolverLink *link = cache_->netIfs.previous; link != &cache_->netIfs;
+       link = link->previous) {
+    const auto &real = *KARST_RESOLVER_CONTAINER(link, KARSTResolverNetIf, cacheLinks);
+    if (real.uuid == netIf.uuid && real.node && real.node->uuid == netIf.node->uuid) return real;
+  }
+  host::panic("lockstep: interface %s is not cached and should be", name(netIf.uuid).c_str());
+}
+
+void Lockstep::compareNode(model::Node &node, const KARSTResolverNode &real) {
   const zel_UUID &uuid = node.uuid;
+  if (!node.slot) node.slot = &real;
+  if (node.slot != &real || real.uuid != uuid || !isTagged(real))
+    host::panic("lockstep: node %s is not where it was", name(uuid).c_str());
   require<unsigned>(real.refCount, node.references, "references", uuid);
   require<int>(real.reachable, node.reachable, "reachable", uuid);
   require<int>(real.isSelf, node.self, "isSelf", uuid);
   require<int>(real.isWitness, node.witness, "isWitness", uuid);
   require<int>(real.rescanSeen, 0, "rescanSeen", uuid);
+  require<int>(real.dirtyLinks.next != nullptr, node.dirty, "dirty", uuid);
   require(real.majorVersion, node.major, "majorVersion", uuid);
   require(real.minorVersion, node.minor, "minorVersion", uuid);
   require(lengthOf(real.netIfList), node.netIfs.size(), "interfaces", uuid);
@@ -490,9 +562,11 @@ void Lockstep::compareNode(const model::Node &node, const KARSTResolverNode &rea
                 node.set.text().c_str());
 }
 
-void Lockstep::compareNetIf(const model::NetIf &netIf, const KARSTResolverNetIf &real) {
+void Lockstep::compareNetIf(model::NetIf &netIf, const KARSTResolverNetIf &real) {
   const zel_UUID &uuid = netIf.uuid;
-  if (real.uuid != uuid) host::panic("lockstep: interface %s is out of order", name(uuid).c_str());
+  if (!netIf.slot) netIf.slot = &real;
+  if (netIf.slot != &real || real.uuid != uuid)
+    host::panic("lockstep: interface %s is out of order", name(uuid).c_str());
   if (!real.node || real.node->uuid != netIf.node->uuid)
     host::panic("lockstep: interface %s has another owner", name(uuid).c_str());
   require<unsigned>(real.refCount, netIf.references, "references", uuid);
@@ -541,7 +615,7 @@ void Lockstep::atRest() {
     if (activity.kind != Activity::World)
       host::panic("lockstep: a fiber is still inside the module");
   if (!cache_) return;
-  compare();
+  compareWhole();
   const zel_UUID cache{};
   for (const Known &known : instances_)
     if (!known.expected.empty())

@@ -104,9 +104,13 @@ class Lockstep final : public sim::Observer {
   void objectReturned(Activity &activity);
   void answersGrew();
 
-  void compare();
-  void compareNode(const model::Node &node, const KARSTResolverNode &real);
-  void compareNetIf(const model::NetIf &netIf, const KARSTResolverNetIf &real);
+  void compareSection();
+  void compareTouched();
+  void compareWhole();
+  void compareNode(model::Node &node, const KARSTResolverNode &real);
+  void compareNetIf(model::NetIf &netIf, const KARSTResolverNetIf &real);
+  const KARSTResolverNode &realOf(const model::Node &node) const;
+  const KARSTResolverNetIf &realOf(const model::NetIf &netIf) const;
   void compareInstances(const std::vector<model::Instance *> &instances,
                         const KARSTResolverLink &head);
   void compareInstance(Known &instance, KARSTResolverInstance &real);

@@ -73,7 +73,9 @@ Input Inputs::take(Input::Kind kind, uint8_t type, const zel_UUID &uuid) {
 
 Node *Resolver::find(const zel_UUID &uuid) {
   const auto found = nodes.find(uuid);
-  return found == nodes.end() ? nullptr : found->second.get();
+  if (found == nodes.end()) return nullptr;
+  touchedNodes.add(*found->second);
+  return found->second.get();
 }
 
 Node *Resolver::findOrCreate(const zel_UUID &uuid) {
@@ -86,18 +88,22 @@ Node *Resolver::findOrCreate(const zel_UUID &uuid) {
   auto node = std::make_unique<Node>();
   node->uuid = uuid;
   node->self = uuid == self;
+  touchedNodes.add(*node);
   return (nodes[uuid] = std::move(node)).get();
 }
 
 void Resolver::mark(Node &node) {
+  touchedNodes.add(node);
   if (!enabled || node.dirty) return;
   node.dirty = true;
   dirty.push_back(&node);
 }
 
 void Resolver::release(Node *node) {
+  touchedNodes.add(*node);
   if (--node->references != 0) return;
   if (node->dirty) std::erase(dirty, node);
+  touchedNodes.remove(*node);
   nodes.erase(node->uuid);
 }
 
@@ -163,8 +169,11 @@ void Resolver::rescanNodes(Inputs &inputs) {
 
 NetIf *Resolver::findNetIf(const zel_UUID &owner, const zel_UUID &uuid) {
   if (Node *node = find(owner))
-    for (NetIf *netIf : node->netIfs)
-      if (netIf->uuid == uuid) return netIf;
+    for (NetIf *netIf : node->netIfs) {
+      if (netIf->uuid != uuid) continue;
+      touchedNetIfs.add(*netIf);
+      return netIf;
+    }
   return nullptr;
 }
 
@@ -185,6 +194,7 @@ NetIf *Resolver::findOrCreateNetIf(const zel_UUID &owner, const zel_UUID &uuid, 
   netIfs.push_back(netIf);
   node->netIfs.push_back(netIf);
   ++node->references;
+  touchedNetIfs.add(*netIf);
   updateHealth(*netIf, inputs);
   return netIf;
 }
@@ -218,7 +228,9 @@ void Resolver::updateHealth(NetIf &netIf, Inputs &inputs) {
 }
 
 void Resolver::releaseNetIf(NetIf &netIf) {
-  if (--netIf.references == 0) slots.erase(&netIf);
+  if (--netIf.references != 0) return;
+  touchedNetIfs.remove(netIf);
+  slots.erase(&netIf);
 }
 
 void Resolver::destroyNetIf(NetIf &netIf) {
@@ -267,6 +279,7 @@ void Resolver::healthCall(const void *data, zel_Status status, Inputs &inputs) {
     followed.erase(found);
     releaseNetIf(netIf);
   } else if (netIf.node) {
+    touchedNetIfs.add(netIf);
     updateHealth(netIf, inputs);
   }
 }
@@ -320,6 +333,7 @@ void Resolver::installHealth(Inputs &inputs) {
     if (netIf->watched) continue;
     const Input made = inputs.take(Input::Subscribed, KARST_TYPE_HEALTH_STATUS, netIf->uuid);
     if (made.status != ZEL_OK) continue;
+    touchedNetIfs.add(*netIf);
     netIf->watched = true;
     followed[made.data] = netIf;
     ++netIf->references;
@@ -335,6 +349,7 @@ void Resolver::workOff(Inputs &inputs) {
     Node *node = dirty.front();
     dirty.pop_front();
     node->dirty = false;
+    touchedNodes.add(*node);
     generate(*node);
     if (node->instances.empty()) continue;
     ++node->references;
@@ -347,6 +362,7 @@ void Resolver::workOff(Inputs &inputs) {
 }
 
 void Resolver::worldSection(Inputs &inputs) {
+  if (refreshing) touchedNodes.add(*refreshing);
   switch (stage_) {
     case Stage::Cycle:
       installHealth(inputs);
@@ -418,7 +434,10 @@ void Resolver::destroy(Instance &instance) {
 
 void Resolver::learnSelf(Inputs &inputs) {
   self = inputs.take(Input::Self, 0, {}).header.uuid;
-  for (auto &[uuid, node] : nodes) node->self = uuid == self;
+  for (auto &[uuid, node] : nodes) {
+    touchedNodes.add(*node);
+    node->self = uuid == self;
+  }
 }
 
 void Resolver::forgetEntries() {

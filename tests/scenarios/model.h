@@ -11,6 +11,7 @@
 #include <map>
 #include <memory>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "host/kernel/uuid.h"
@@ -60,6 +61,8 @@ struct NetIf {
   bool watched = false;
   bool seen = false;
   unsigned references = 1;
+  bool touched = false;
+  const void *slot = nullptr; /* where the module keeps it, once somebody has seen it there */
 };
 
 struct Instance {
@@ -79,6 +82,30 @@ struct Node {
   std::vector<NetIf *> netIfs;
   std::vector<Instance *> instances;
   Answer set; /* its locators; the state is not used */
+  bool touched = false;
+  const void *slot = nullptr; /* as above */
+};
+
+/* What sections have named or changed, each once; what goes is no longer among them. */
+template <typename Element>
+class Touched {
+ public:
+  void add(Element &element) {
+    if (!std::exchange(element.touched, true)) elements_.push_back(&element);
+  }
+  void remove(Element &element) {
+    if (element.touched) std::erase(elements_, &element);
+  }
+  void clear() {
+    for (Element *element : elements_) element->touched = false;
+    elements_.clear();
+  }
+  size_t size() const { return elements_.size(); }
+  auto begin() const { return elements_.begin(); }
+  auto end() const { return elements_.end(); }
+
+ private:
+  std::vector<Element *> elements_;
 };
 
 /* What the module learnt while it worked: answers of the platform, in order. */
@@ -142,6 +169,10 @@ class Resolver {
   std::map<const void *, NetIf *> followed;        /* by a health subscription, to its last call */
   std::vector<Instance *> pending;                 /* that the world has moved aside, front first */
   Node *refreshing = nullptr;
+
+  /* Since they were cleared last. */
+  Touched<Node> touchedNodes;
+  Touched<NetIf> touchedNetIfs;
 
  private:
   enum class Stage { Cycle, Refresh, Resume };

@@ -4,6 +4,7 @@
 #include "sim/callbacks.h"
 
 #include <algorithm>
+#include <iterator>
 
 #include "host/kernel/panic.h"
 #include "sim/access/access.h"
@@ -20,6 +21,9 @@ struct CallbackTable::Subscription {
   void *data;
   uint8_t type;
   bool cancelled = false; /* only the last call is left */
+  std::list<Subscription>::iterator place{};
+
+  Key key() const { return {query, reinterpret_cast<const void *>(fn), data}; }
 };
 
 struct CallbackTable::Registration {
@@ -35,11 +39,14 @@ CallbackTable::~CallbackTable() = default;
 zel_Status CallbackTable::subscribe(host::Directory &directory, const KarstQuery *query,
                                     KarstSubscriptionFn fn, void *data) {
   if (!query || !fn) return ZEL_BAD_PARAM;
-  subscriptions_.push_back({this, query, fn, data, query->type});
-  access::publish(&subscriptions_.back());
-  const zel_Status status = directory.subscribe(query, &callSubscriber, &subscriptions_.back());
-  if (status != ZEL_OK) {
-    access::forget(&subscriptions_.back());
+  Subscription &made = subscriptions_.emplace_back(this, query, fn, data, query->type);
+  made.place = std::prev(subscriptions_.end());
+  access::publish(&made);
+  const zel_Status status = directory.subscribe(query, &callSubscriber, &made);
+  if (status == ZEL_OK) {
+    open_.emplace(made.key(), &made);
+  } else {
+    access::forget(&made);
     subscriptions_.pop_back();
   }
   return status;
@@ -47,14 +54,13 @@ zel_Status CallbackTable::subscribe(host::Directory &directory, const KarstQuery
 
 void CallbackTable::unsubscribe(host::Directory &directory, const KarstQuery *query,
                                 KarstSubscriptionFn fn, void *data) {
-  const auto found =
-      std::find_if(subscriptions_.begin(), subscriptions_.end(), [=](const Subscription &one) {
-        return !one.cancelled && one.query == query && one.fn == fn && one.data == data;
-      });
-  if (found == subscriptions_.end()) return;
-  access::publish(&found->cancelled);
-  found->cancelled = true;
-  directory.unsubscribe(query, &callSubscriber, &*found);
+  const auto found = open_.find({query, reinterpret_cast<const void *>(fn), data});
+  if (found == open_.end()) return;
+  Subscription &subscription = *found->second;
+  open_.erase(found);
+  access::publish(&subscription.cancelled);
+  subscription.cancelled = true;
+  directory.unsubscribe(query, &callSubscriber, &subscription);
 }
 
 zel_Status CallbackTable::callSubscriber(void *record, const KarstEntryHeader *header,
@@ -79,8 +85,7 @@ zel_Status CallbackTable::callSubscriber(void *record, const KarstEntryHeader *h
   if (status == ZEL_SUB_CANCELLED) {
     access::forget(&subscription);
     access::forget(&subscription.cancelled);
-    subscription.table->subscriptions_.remove_if(
-        [&](const Subscription &one) { return &one == &subscription; });
+    subscription.table->subscriptions_.erase(subscription.place);
   }
   return result;
 }

@@ -5,7 +5,8 @@
 #pragma once
 
 #include <list>
-#include <memory>
+#include <map>
+#include <tuple>
 
 #include "host/directory/directory.h"
 #include "platform/karst_directory.h"
@@ -39,7 +40,10 @@ class CallbackTable {
                                    zel_Status status);
   static void callStatus(void *record, uint32_t status);
 
-  std::list<Subscription> subscriptions_; /* oldest first */
+  using Key = std::tuple<const KarstQuery *, const void *, const void *>; /* query, fn, data */
+
+  std::list<Subscription> subscriptions_;   /* oldest first */
+  std::multimap<Key, Subscription *> open_; /* not cancelled; of equals the oldest first */
   std::list<Registration> registrations_;
 };
 

@@ -74,12 +74,13 @@ void addEdge(const Fiber &fiber, uint8_t held, uint8_t wanted) {
 
 }  // namespace
 
-uint8_t LockOrder::classOf(const std::string &name) {
+uint8_t LockOrder::classOf(std::string_view name) {
   std::vector<std::string> &names = graph().names;
   const auto found = std::find(names.begin() + 1, names.end(), name);
   if (found != names.end()) return static_cast<uint8_t>(found - names.begin());
-  if (names.size() == mostClasses) host::panic("\"%s\": too many names of locks", name.c_str());
-  names.push_back(name);
+  if (names.size() == mostClasses)
+    host::panic("\"%s\": too many names of locks", std::string(name).c_str());
+  names.emplace_back(name);
   return static_cast<uint8_t>(names.size() - 1);
 }
 
@@ -94,9 +95,10 @@ void LockOrder::requireOrder(const Fiber &fiber, uint8_t lockClass) {
   for (uint32_t i = 0; i < fiber.insideCount; ++i) addEdge(fiber, fiber.inside[i], lockClass);
 }
 
-Inside::Inside(Fiber &fiber, const std::string &what) : fiber_(fiber) {
+Inside::Inside(Fiber &fiber, std::string_view what) : fiber_(fiber) {
   if (fiber.insideCount == fiber.inside.size()) {
-    host::panic("%s is inside too much to enter %s", fiber.name().c_str(), what.c_str());
+    host::panic("%s is inside too much to enter %s", fiber.name().c_str(),
+                std::string(what).c_str());
   }
   const uint8_t entered = LockOrder::classOf(what);
   LockOrder::requireOrder(fiber, entered);

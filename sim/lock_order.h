@@ -8,6 +8,7 @@
 
 #include <cstdint>
 #include <string>
+#include <string_view>
 
 #include "sim/fiber.h"
 
@@ -16,7 +17,7 @@ namespace sim {
 class LockOrder {
  public:
   /* The number of a class of locks, from 1 on: all locks of a name are one class. */
-  static uint8_t classOf(const std::string &name);
+  static uint8_t classOf(std::string_view name);
   static std::string name(uint32_t lockClass);
 
   /* The fiber is about to take, or to wait for, a lock of the class. */
@@ -26,7 +27,7 @@ class LockOrder {
 /* A fiber is inside something that is no spinlock but that others may wait for. */
 class Inside {
  public:
-  Inside(Fiber &fiber, const std::string &what);
+  Inside(Fiber &fiber, std::string_view what);
   ~Inside();
   Inside(const Inside &) = delete;
   Inside &operator=(const Inside &) = delete;

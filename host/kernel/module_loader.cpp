@@ -129,12 +129,14 @@ bool isResident(const std::string &path) {
 struct Module::Impl : std::enable_shared_from_this<Module::Impl> {
   explicit Impl(const std::filesystem::path &path) : file(path) {}
   static std::shared_ptr<Impl> of(const std::filesystem::path &path); /* kept from before, or new */
+  static std::shared_ptr<Impl> keptAt(const std::filesystem::path &path); /* or null */
   void map();
   void unmap();
   void keep(const ElfImage &image);
   void setParameters(const std::vector<ParameterValue> &values) const;
 
   ModuleFile file;
+  std::filesystem::path asked; /* what it was loaded by first */
   void *handle = nullptr;
   MappedModule mapped;
   std::set<const Module *> uses; /* whose namespaces it requires, or whose exports it calls */
@@ -150,14 +152,26 @@ std::mutex Module::Impl::keptLock;
 bool Module::Impl::keeping = false;
 std::vector<std::shared_ptr<Module::Impl>> Module::Impl::kept;
 
-std::shared_ptr<Module::Impl> Module::Impl::of(const std::filesystem::path &path) {
-  const std::lock_guard guard(keptLock);
+std::shared_ptr<Module::Impl> Module::Impl::keptAt(const std::filesystem::path &path) {
   for (const auto &known : kept) {
-    if (known->loaded || known->file.path != path) continue;
+    if (known->loaded || (known->asked != path && known->file.path != path)) continue;
     known->uses.clear();
     return known;
   }
-  return std::make_shared<Impl>(path);
+  return nullptr;
+}
+
+/* One that is kept is mostly loaded by the same path again: the system need not be asked where that
+ * leads. */
+std::shared_ptr<Module::Impl> Module::Impl::of(const std::filesystem::path &path) {
+  const std::lock_guard guard(keptLock);
+  if (auto known = keptAt(path)) return known;
+  std::error_code error;
+  const auto canonical = std::filesystem::canonical(path, error);
+  if (auto known = keptAt(canonical)) return known;
+  auto made = std::make_shared<Impl>(error ? path : canonical);
+  made->asked = path;
+  return made;
 }
 
 /* One with constructors begins afresh only when it is mapped, and one that uses another goes with
@@ -376,9 +390,7 @@ ModuleLoader::~ModuleLoader() {
 Module &ModuleLoader::load(const std::filesystem::path &path,
                            const std::vector<std::string> &parameters) {
   const std::lock_guard loading(impl_->loadLock);
-  std::error_code error;
-  const auto canonical = std::filesystem::canonical(path, error);
-  const std::shared_ptr<Module::Impl> module = Module::Impl::of(error ? path : canonical);
+  const std::shared_ptr<Module::Impl> module = Module::Impl::of(path);
   module->mapped.name = module->file.path.filename().string();
   module->mapped.id = nextModuleID();
 

@@ -34,9 +34,14 @@ ModuleMemory::ModuleMemory(uintptr_t base, size_t size) {
     }
     const int protection = (rights[0] == 'r' ? PROT_READ : 0) |
                            (rights[1] == 'w' ? PROT_WRITE : 0) | (rights[2] == 'x' ? PROT_EXEC : 0);
-    Pages &pages = pages_.emplace_back(Pages{begin, end - begin, protection, {}});
-    if (protection & PROT_WRITE)
-      pages.content.assign(reinterpret_cast<const char *>(begin), pages.size);
+    const bool writable = protection & PROT_WRITE;
+    if (pages_.empty() || writable || pages_.back().protection & PROT_WRITE) {
+      pages_.push_back({begin, 0, 0, {}});
+    }
+    Pages &pages = pages_.back();
+    pages.size += end - begin;
+    pages.protection |= protection;
+    if (writable) pages.content.assign(reinterpret_cast<const char *>(begin), pages.size);
   }
   if (pages_.empty()) panic("the pages of a module are not known");
 }

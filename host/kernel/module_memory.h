@@ -20,6 +20,8 @@ class ModuleMemory {
   void renew() const;    /* as at first: its variables, and what can be done with it */
 
  private:
+  /* What can be written is apart. Of the rest all can be run, where some of it can: a system call
+   * for each change of rights is dear where a module is loaded again and again. */
   struct Pages {
     uintptr_t begin;
     size_t size;

@@ -4,7 +4,6 @@
 #include "host/kernel/heap.h"
 
 #include <algorithm>
-#include <bit>
 #include <cinttypes>
 #include <cstdlib>
 #include <limits>
@@ -47,7 +46,7 @@ class Heap {
       : memory_(memory),
         name_(toString(props.name)),
         maximum_(props.maximumSize),
-        buckets_(bucketsFor(props.maximumSize)) {}
+        buckets_(kFirstBuckets) {}
 
   ~Heap() {
     while (oldest_ != nullptr) {
@@ -75,6 +74,7 @@ class Heap {
     used_ += space;
     peak_ = std::max(peak_, used_);
     allocations_++;
+    if (++blocks_ > buckets_.size()) spread();
     return header->block();
   }
 
@@ -91,6 +91,7 @@ class Heap {
     (header->older == nullptr ? oldest_ : header->older->newer) = header->newer;
     (header->newer == nullptr ? newest_ : header->newer->older) = header->older;
     used_ -= heapSpaceFor(header->size);
+    blocks_--;
     return header;
   }
 
@@ -103,9 +104,21 @@ class Heap {
   }
 
  private:
-  static size_t bucketsFor(uint32_t maximum) {
-    const uint32_t blocksExpected = std::clamp(maximum / 512, 64u, 65536u);
-    return std::bit_ceil(blocksExpected);
+  static constexpr size_t kFirstBuckets = 64;
+
+  /* Over four times the buckets: most heaps hold few blocks, and some very many. Where there is no
+   * memory for them, what there is does as well. */
+  void spread() {
+    try {
+      buckets_.assign(buckets_.size() * 4, nullptr);
+    } catch (const std::bad_alloc &) {
+      return;
+    }
+    for (BlockHeader *header = oldest_; header != nullptr; header = header->newer) {
+      BlockHeader *&bucket = bucketOf(header->block());
+      header->nextInBucket = bucket;
+      bucket = header;
+    }
   }
 
   BlockHeader *&bucketOf(const void *block) {
@@ -119,6 +132,7 @@ class Heap {
   uint32_t used_ = 0;
   uint32_t peak_ = 0;
   uint64_t allocations_ = 0;
+  size_t blocks_ = 0;
   BlockHeader *oldest_ = nullptr;
   BlockHeader *newest_ = nullptr;
   std::vector<BlockHeader *> buckets_;

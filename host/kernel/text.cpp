@@ -53,12 +53,15 @@ std::string formatText(const char *format, ...) {
 }
 
 std::string vformatText(const char *format, va_list arguments) {
+  char buffer[256]; /* most texts fit, and are made only once */
   va_list measured;
   va_copy(measured, arguments);
-  const int length = std::vsnprintf(nullptr, 0, format, measured);
+  const int length = std::vsnprintf(buffer, sizeof buffer, format, measured);
   va_end(measured);
   if (length < 0) return format;
-  std::string text(static_cast<size_t>(length), '\0');
+  const auto size = static_cast<size_t>(length);
+  if (size < sizeof buffer) return {buffer, size};
+  std::string text(size, '\0');
   std::vsnprintf(text.data(), text.size() + 1, format, arguments);
   return text;
 }

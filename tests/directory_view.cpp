@@ -92,27 +92,35 @@ Nodes nodesOf(const KARSTResolverCache *cache, Lines &lines) {
 
 /* But for the tag and the place on the free list. */
 template <typename Slot>
-bool isEmpty(Slot slot) {
+bool isEmpty(const Slot &slot) {
   static constexpr Slot empty{};
-  std::memset(slot.tag, 0, sizeof slot.tag);
-  slot.freeLinks = {};
-  return std::memcmp(&slot, &empty, sizeof slot) == 0;
+  constexpr size_t links = offsetof(Slot, freeLinks), behind = links + sizeof empty.freeLinks;
+  const auto same = [&](size_t from, size_t to) {
+    return std::memcmp(reinterpret_cast<const uint8_t *>(&slot) + from,
+                       reinterpret_cast<const uint8_t *>(&empty) + from, to - from) == 0;
+  };
+  return same(sizeof empty.tag, links) && same(behind, sizeof empty);
 }
 
-/* Every slot is in use and known, or free, listed and empty. */
+/* Every slot is in use and known, or free, listed and, as far as it is looked into, empty. */
 template <typename Slot>
 void checkSlots(const Slot *pool, uint32_t size, const char *tag,
-                const std::set<const Slot *> &used, const KARSTResolverLink &freeList,
-                Lines &lines) {
+                const std::vector<const Slot *> &used, const KARSTResolverLink &freeList,
+                const SlotSample &sample, Lines &lines) {
   const std::string what = std::string(tag, 8) + " slots";
   const auto free = elementsOf<Slot>(freeList, offsetof(Slot, freeLinks), what, lines);
-  std::vector<bool> listed(size);
-  for (const Slot *slot : free) {
-    if (slot >= pool && slot < pool + size) listed[static_cast<size_t>(slot - pool)] = true;
-  }
+  const auto placesOf = [&](const std::vector<const Slot *> &slots) {
+    std::vector<bool> places(size);
+    for (const Slot *slot : slots) {
+      if (slot >= pool && slot < pool + size) places[static_cast<size_t>(slot - pool)] = true;
+    }
+    return places;
+  };
+  const std::vector<bool> listed = placesOf(free), inUse = placesOf(used);
   for (uint32_t i = 0; i < size; i++) {
-    const bool inUse = used.count(&pool[i]) != 0;
-    if (listed[i] == inUse || !isTag(pool[i].tag, tag, !inUse) || (!inUse && !isEmpty(pool[i]))) {
+    const bool lookInto = !inUse[i] && i % sample.step == sample.first;
+    if (listed[i] == inUse[i] || !isTag(pool[i].tag, tag, !inUse[i]) ||
+        (lookInto && !isEmpty(pool[i]))) {
       lines.push_back(formatText("%s: %u is neither in use nor free", what.c_str(), i));
     }
   }
@@ -375,14 +383,15 @@ DirectoryView viewOf(const host::Directory &directory, const zel_UUID &self, boo
   return view;
 }
 
-Lines differencesOf(const KARSTResolverCache *cache, const DirectoryView &view) {
+Lines differencesOf(const KARSTResolverCache *cache, const DirectoryView &view,
+                    const SlotSample &sample) {
   Lines lines;
   const Nodes nodes = nodesOf(cache, lines);
   const NetIfs netIfs = netIfsOf(cache, lines);
-  checkSlots(cache->nodePool, KARST_RESOLVER_NODE_POOL_SIZE, KARST_RESOLVER_TAG_NODE,
-             {nodes.begin(), nodes.end()}, cache->freeNodes, lines);
-  checkSlots(cache->netIfPool, KARST_RESOLVER_NETIF_POOL_SIZE, KARST_RESOLVER_TAG_NETIF,
-             {netIfs.begin(), netIfs.end()}, cache->freeNetIfs, lines);
+  checkSlots(cache->nodePool, KARST_RESOLVER_NODE_POOL_SIZE, KARST_RESOLVER_TAG_NODE, nodes,
+             cache->freeNodes, sample, lines);
+  checkSlots(cache->netIfPool, KARST_RESOLVER_NETIF_POOL_SIZE, KARST_RESOLVER_TAG_NETIF, netIfs,
+             cache->freeNetIfs, sample, lines);
   if (cache->dirtyNodes.next != &cache->dirtyNodes) lines.push_back("dirty nodes");
   if (!isTag(cache->tag, KARST_RESOLVER_TAG_CACHE)) lines.push_back("cache: its tag is wrong");
   if (!lines.empty()) return lines; /* what follows relies on it */

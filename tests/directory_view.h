@@ -41,8 +41,15 @@ struct DirectoryView {
 DirectoryView viewOf(const host::Directory &directory, const zel_UUID &self, bool witnessHost,
                      const std::vector<HeldInstance> &held = {});
 
+/* Which slots are looked into whether they are empty, if they are free: every `step`-th. */
+struct SlotSample {
+  size_t step = 1;
+  size_t first = 0;
+};
+
 /* What is broken in the cache itself (tree, lists, slots, tags), or else every difference of an
  * enabled cache from the view, a line each; none: they are equal. To be asked when nothing is due any
  * more. Needs a directory that fits into the cache's slots. A new version or witness flag of a node
  * alone changes no locators: have each such node marked dirty before. */
-std::vector<std::string> differencesOf(const KARSTResolverCache *cache, const DirectoryView &view);
+std::vector<std::string> differencesOf(const KARSTResolverCache *cache, const DirectoryView &view,
+                                       const SlotSample &sample = {});

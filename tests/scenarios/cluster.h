@@ -24,8 +24,9 @@ class Cluster {
   /* One operation, on the fiber of its actor. One that makes no sense now does nothing. */
   void perform(const sim::Operation &operation);
 
-  /* From outside every fiber. Runs until all is quiet, and checks everything that holds then. */
-  void rest();
+  /* From outside every fiber. Runs until all is quiet, and checks everything that holds then; where
+   * the same course has been checked before, that is left out. */
+  void rest(bool checked = false);
 
   /* Destroys what is there, unloads, and lets nothing be left. */
   void close();
@@ -80,7 +81,7 @@ class Cluster {
   void recover(); /* after faults: makes the module take in what it has missed */
   void resync();
   void touchNews();
-  void requireQuiet();
+  void requireQuiet(); /* and that the model and clients hold what they should then */
   void requireEnabled();
   void requireDirectoryTaken();
   void requireClientsTold();

@@ -4,6 +4,7 @@
 #include "tests/scenarios/scenarios.h"
 
 #include <algorithm>
+#include <set>
 
 #include "sim/random.h"
 #include "tests/scenarios/actions.h"
@@ -266,8 +267,10 @@ class Tabled final : public sim::Scenario {
 
  private:
   void playPhase(Cluster &cluster, const std::vector<Operation> &operations) const;
+  bool isKnown(const Plan &plan, uint8_t phase, bool witness) const;
 
   const Profile profile_;
+  mutable std::set<std::pair<uint8_t, bool>> known_;
 };
 
 Plan Tabled::plan(uint64_t seed, size_t length) const {
@@ -313,6 +316,13 @@ void Tabled::playPhase(Cluster &cluster, const std::vector<Operation> &operation
   }
 }
 
+/* What a small scenario begins with is not part of the search: it takes the same course in each run,
+ * and need be checked in the first one of a process only. */
+bool Tabled::isKnown(const Plan &plan, uint8_t phase, bool witness) const {
+  return plan.operations == profile_.script && plan.faults.empty() &&
+         !known_.emplace(phase, witness).second;
+}
+
 sim::Outcome Tabled::play(const Plan &plan, const sim::Run &run) const {
   sim::Settings settings;
   settings.seed = run.seed;
@@ -334,11 +344,10 @@ sim::Outcome Tabled::play(const Plan &plan, const sim::Run &run) const {
     const uint8_t phase = begin->phase;
     const auto end = std::find_if(begin, plan.operations.end(),
                                   [=](const Operation &one) { return one.phase != phase; });
-    /* What a small scenario begins with is not part of the search. */
-    if (!small() || phase > 1)
-      simulation.setStrategy(std::make_unique<sim::Borrowed>(*run.strategy));
+    const bool searched = !small() || phase > 1;
+    if (searched) simulation.setStrategy(std::make_unique<sim::Borrowed>(*run.strategy));
     playPhase(cluster, {begin, end});
-    cluster.rest();
+    cluster.rest(!searched && isKnown(plan, phase, settings.witness));
     begin = end;
   }
   if (small()) simulation.setSwitching(sim::Switching::WhenBlocked);

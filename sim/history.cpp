@@ -44,14 +44,6 @@ Argument Argument::name(const zel_Name &name) {
   return argument;
 }
 
-uint64_t Argument::hash() const {
-  constexpr size_t wordsUsed[] = {0, 1, 2, 4}; /* by kind */
-  uint64_t hash = static_cast<uint64_t>(kind_) << 8 | type_;
-  for (size_t i = 0; i < wordsUsed[static_cast<size_t>(kind_)]; ++i)
-    hash = (hash ^ words_[i]) * 0x9e3779b97f4a7c15u + (hash >> 31);
-  return hash;
-}
-
 std::string Argument::toString() const {
   switch (kind_) {
     case Kind::None:

@@ -10,7 +10,7 @@
 #include <boost/context/detail/fcontext.hpp>
 #include <boost/context/protected_fixedsize_stack.hpp>
 #include <cstring>
-#include <set>
+#include <unordered_set>
 #include <utility>
 
 #include "host/kernel/panic.h"
@@ -26,7 +26,7 @@ namespace {
 
 /* The one text of a name, for as long as the program runs: a history is read after its machine. */
 const std::string *intern(const std::string &name) {
-  static std::set<std::string> names;
+  static std::unordered_set<std::string> names;
   return &*names.insert(name).first;
 }
 

@@ -12,6 +12,7 @@ size_t RunOn::pick(size_t) {
 }
 
 Fiber &RandomWalk::next(std::span<Fiber *const> runnable, Fiber *current) {
+  if (runnable.size() == 1) return *runnable.front();
   if (current && every_ > 1 && random_.below(every_) != 0) return *current;
   return *runnable[random_.below(runnable.size())];
 }

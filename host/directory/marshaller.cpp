@@ -12,6 +12,8 @@
 namespace host {
 namespace {
 
+constexpr size_t kUsualSize = 256; /* of an encoded record, in bytes; most are smaller */
+
 constexpr size_t addressSize = 16;
 constexpr size_t macSize = 6;
 constexpr size_t maxRows = 64; /* one bit each says which names were seen */
@@ -153,6 +155,7 @@ zel_Status marshal(const ExprMshField *table, const void *record, std::vector<ui
   const std::optional<size_t> rows = usableRows(table);
   if (!rows) return ZEL_BAD_PARAM;
   const size_t before = out->size();
+  out->reserve(before + kUsualSize);
   ExprMshWriter writer{out};
   writeMapStart(writer, *rows);
   for (const ExprMshField *row = table; row->name != nullptr; ++row) {

@@ -470,13 +470,18 @@ void Cluster::requireEnabled() {
                 usable_ ? "not " : "");
 }
 
-/* The module holds what the directory says, as far as it fits. */
-void Cluster::requireDirectoryTaken() {
-  host::Directory &directory = simulation_.directory();
-  if (!usable_ || !lockstep_.resolver().enabled) return;
-  if (directory.entries(KARST_TYPE_NODE).size() > 64 ||
-      directory.entries(KARST_TYPE_NET_INTERFACE).size() > 400)
-    return;
+/* The module holds what the directory says, where that fits. */
+std::vector<std::string> Cluster::differences() {
+  /* What is written to a free slot stays there, so one in eight is looked into, other ones after
+   * another course. Where every access is watched, all are. */
+  SlotSample sample;
+  if (!sim::access::watching) sample = {.step = 8, .first = simulation_.traceHash() % 8};
+  const auto fits = [](const auto &nodes, const auto &netIfs) {
+    return nodes.size() <= 64 && netIfs.size() <= 400;
+  };
+  const model::Resolver &resolver = lockstep_.resolver();
+  if (!usable_ || !resolver.enabled || !fits(resolver.nodes, resolver.netIfs))
+    return damageOf(lockstep_.cache(), sample);
   std::vector<HeldInstance> held;
   for (const Client *client : slots_) {
     if (!client) continue;
@@ -484,15 +489,16 @@ void Cluster::requireDirectoryTaken() {
     if (client->hasCallback) one.told = client->model->answers[client->lastTold].state;
     held.push_back(one);
   }
-  const DirectoryView view = viewOf(directory, nodeUUID(1), simulation_.settings().witness, held);
-  /* What is written to a free slot stays there, so one in eight is looked into, other ones after
-   * another course. Where every access is watched, all are. */
-  SlotSample sample;
-  if (!sim::access::watching) sample = {.step = 8, .first = simulation_.traceHash() % 8};
-  const std::vector<std::string> differences = differencesOf(lockstep_.cache(), view, sample);
-  if (differences.empty()) return;
+  const DirectoryView view =
+      viewOf(simulation_.directory(), nodeUUID(1), simulation_.settings().witness, held);
+  return fits(view.nodes, view.netIfs) ? differencesOf(lockstep_.cache(), view, sample)
+                                       : damageOf(lockstep_.cache(), sample);
+}
+
+void Cluster::requireDirectoryTaken() {
   std::string text;
-  for (const std::string &line : differences) text += "\n  " + line;
+  for (const std::string &line : differences()) text += "\n  " + line;
+  if (text.empty()) return;
   host::panic("the module and the directory differ:%s", text.c_str());
 }
 

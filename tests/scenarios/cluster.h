@@ -83,6 +83,7 @@ class Cluster {
   void touchNews();
   void requireQuiet(); /* and that the model and clients hold what they should then */
   void requireEnabled();
+  std::vector<std::string> differences();
   void requireDirectoryTaken();
   void requireClientsTold();
   void requireTraces();

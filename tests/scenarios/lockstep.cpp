@@ -50,8 +50,16 @@ void requireSections(unsigned sections, unsigned wanted) {
               wanted);
 }
 
-bool isTagged(const KARSTResolverNode &node) {
-  return std::memcmp(node.tag, KARST_RESOLVER_TAG_NODE, sizeof node.tag) == 0;
+/* In use, by its tag. */
+template <typename Slot>
+bool isTagged(const Slot &slot, const char *tag) {
+  return std::memcmp(slot.tag, tag, sizeof slot.tag) == 0;
+}
+
+/* The module's and the model's are the same. */
+template <typename Element, typename Slot>
+bool isAt(const Element &element, const Slot &slot) {
+  return element.slot ? element.slot == &slot : element.uuid == slot.uuid;
 }
 
 /* A list begins and ends with those that it should. `links`: where an element has its own. */
@@ -60,18 +68,12 @@ void requireEnds(const Wanted &wanted, const KARSTResolverLink &head, size_t lin
                  const char *what) {
   const auto is = [&](const KARSTResolverLink *link, const auto *element) {
     const auto *bytes = reinterpret_cast<const uint8_t *>(link) - links;
-    return link != &head && reinterpret_cast<const Real *>(bytes)->uuid == element->uuid;
+    return link != &head && isAt(*element, *reinterpret_cast<const Real *>(bytes));
   };
   if (wanted.empty() ? head.next == &head
                      : is(head.next, wanted.front()) && is(head.previous, wanted.back()))
     return;
   host::panic("lockstep: another %s than it should is the first or last one", what);
-}
-
-size_t lengthOf(const KARSTResolverLink &head) {
-  size_t length = 0;
-  for (const KARSTResolverLink *link = head.next; link != &head; link = link->next) ++length;
-  return length;
 }
 
 }  // namespace
@@ -452,14 +454,15 @@ void Lockstep::answersGrew() {
 /* ---- Comparison ------------------------------------------------------------------------------ */
 
 /* Where every access is watched, everything after each section. Else what the section has touched,
- * and the rest at every few sections: what was written to where it does not belong is found a little
- * later, and many more sections are played. */
+ * and everything at every sixteenth, or later where much is held, so that this takes no longer than
+ * the sections themselves: what was written to where it does not belong is found a little later, and
+ * many more sections are played. */
 void Lockstep::compareSection() {
-  constexpr uint64_t betweenWhole = 16;
-  constexpr size_t mostTouched = 32; /* by a rescan, say, which looks at nearly all */
   ++checks_;
+  const size_t held = model_->nodes.size() + model_->netIfs.size();
   const size_t touched = model_->touchedNodes.size() + model_->touchedNetIfs.size();
-  if (sim::access::watching || sections_ % betweenWhole == 0 || touched > mostTouched) {
+  if (sim::access::watching || ++sectionsSinceWhole_ >= std::max<size_t>(16, held / 4) ||
+      touched > held / 4 + 8) {
     compareWhole();
   } else {
     compareTouched();
@@ -483,11 +486,12 @@ void Lockstep::compareTouched() {
 }
 
 void Lockstep::compareWhole() {
+  sectionsSinceWhole_ = 0;
   const zel_UUID cache{};
   require<int>(cache_->enabled, model_->enabled, "enabled", cache);
   size_t inUse = 0;
   for (const KARSTResolverNode &real : std::span(cache_->nodePool, KARST_RESOLVER_NODE_POOL_SIZE)) {
-    if (!isTagged(real)) continue;
+    if (!isTagged(real, KARST_RESOLVER_TAG_NODE)) continue;
     ++inUse;
     const auto found = model_->nodes.find(real.uuid);
     if (found == model_->nodes.end())
@@ -508,10 +512,10 @@ void Lockstep::compareWhole() {
   auto dirty = model_->dirty.begin();
   for (const KARSTResolverLink *link = cache_->dirtyNodes.next; link != &cache_->dirtyNodes;
        link = link->next) {
-    const zel_UUID &uuid = KARST_RESOLVER_CONTAINER(link, KARSTResolverNode, dirtyLinks)->uuid;
-    if (dirty == model_->dirty.end() || (*dirty++)->uuid != uuid)
+    const auto &real = *KARST_RESOLVER_CONTAINER(link, KARSTResolverNode, dirtyLinks);
+    if (dirty == model_->dirty.end() || !isAt(**dirty++, real))
       host::panic("lockstep: node %s stands where it should not in the dirty queue",
-                  name(uuid).c_str());
+                  name(real.uuid).c_str());
   }
   if (dirty != model_->dirty.end())
     host::panic("lockstep: node %s should be in the dirty queue", name((*dirty)->uuid).c_str());
@@ -521,7 +525,7 @@ void Lockstep::compareWhole() {
 const KARSTResolverNode &Lockstep::realOf(const model::Node &node) const {
   if (node.slot) return *static_cast<const KARSTResolverNode *>(node.slot);
   for (const KARSTResolverNode &real : std::span(cache_->nodePool, KARST_RESOLVER_NODE_POOL_SIZE))
-    if (real.uuid == node.uuid && isTagged(real)) return real;
+    if (real.uuid == node.uuid && isTagged(real, KARST_RESOLVER_TAG_NODE)) return real;
   host::panic("lockstep: node %s is not cached and should be", name(node.uuid).c_str());
 }
 
@@ -531,7 +535,7 @@ const KARSTResolverNetIf &Lockstep::realOf(const model::NetIf &netIf) const {
   for (const KARSTResolverLink *link = cache_->netIfs.previous; link != &cache_->netIfs;
        link = link->previous) {
     const auto &real = *KARST_RESOLVER_CONTAINER(link, KARSTResolverNetIf, cacheLinks);
-    if (real.uuid == netIf.uuid && real.node && real.node->uuid == netIf.node->uuid) return real;
+    if (real.uuid == netIf.uuid && real.node && isAt(*netIf.node, *real.node)) return real;
   }
   host::panic("lockstep: interface %s is not cached and should be", name(netIf.uuid).c_str());
 }
@@ -539,7 +543,7 @@ const KARSTResolverNetIf &Lockstep::realOf(const model::NetIf &netIf) const {
 void Lockstep::compareNode(model::Node &node, const KARSTResolverNode &real) {
   const zel_UUID &uuid = node.uuid;
   if (!node.slot) node.slot = &real;
-  if (node.slot != &real || real.uuid != uuid || !isTagged(real))
+  if (node.slot != &real || real.uuid != uuid || !isTagged(real, KARST_RESOLVER_TAG_NODE))
     host::panic("lockstep: node %s is not where it was", name(uuid).c_str());
   require<unsigned>(real.refCount, node.references, "references", uuid);
   require<int>(real.reachable, node.reachable, "reachable", uuid);
@@ -549,12 +553,14 @@ void Lockstep::compareNode(model::Node &node, const KARSTResolverNode &real) {
   require<int>(real.dirtyLinks.next != nullptr, node.dirty, "dirty", uuid);
   require(real.majorVersion, node.major, "majorVersion", uuid);
   require(real.minorVersion, node.minor, "minorVersion", uuid);
-  require(lengthOf(real.netIfList), node.netIfs.size(), "interfaces", uuid);
   auto netIf = node.netIfs.begin();
   for (const KARSTResolverLink *link = real.netIfList.next; link != &real.netIfList;
        link = link->next)
-    if (KARST_RESOLVER_CONTAINER(link, KARSTResolverNetIf, nodeLinks)->uuid != (*netIf++)->uuid)
+    if (netIf == node.netIfs.end() ||
+        !isAt(**netIf++, *KARST_RESOLVER_CONTAINER(link, KARSTResolverNetIf, nodeLinks)))
       host::panic("lockstep: the interfaces of %s are out of order", name(uuid).c_str());
+  if (netIf != node.netIfs.end())
+    host::panic("lockstep: node %s has fewer interfaces than it should", name(uuid).c_str());
   compareInstances(node.instances, real.instanceList);
   if (!node.set.is(node.set.state, real.locators))
     host::panic("lockstep: the locators of %s are \"%s\", and should be \"%s\"", name(uuid).c_str(),
@@ -567,7 +573,7 @@ void Lockstep::compareNetIf(model::NetIf &netIf, const KARSTResolverNetIf &real)
   if (!netIf.slot) netIf.slot = &real;
   if (netIf.slot != &real || real.uuid != uuid)
     host::panic("lockstep: interface %s is out of order", name(uuid).c_str());
-  if (!real.node || real.node->uuid != netIf.node->uuid)
+  if (!real.node || !isAt(*netIf.node, *real.node))
     host::panic("lockstep: interface %s has another owner", name(uuid).c_str());
   require<unsigned>(real.refCount, netIf.references, "references", uuid);
   require<int>(real.healthy, netIf.healthy, "healthy", uuid);
@@ -628,10 +634,11 @@ void Lockstep::atRest() {
   }
   require<uint64_t>(cache_->refCount, cacheSubscriptions_ + model_->followed.size() + alive_.size(),
                     "references of the cache", cache);
-  require(lengthOf(cache_->freeNodes), KARST_RESOLVER_NODE_POOL_SIZE - model_->nodes.size(),
-          "free nodes", cache);
-  require(lengthOf(cache_->freeNetIfs), KARST_RESOLVER_NETIF_POOL_SIZE - model_->slots.size(),
-          "free interfaces", cache);
+  const std::span slots(cache_->netIfPool, KARST_RESOLVER_NETIF_POOL_SIZE);
+  const auto inUse = std::count_if(slots.begin(), slots.end(), [](const auto &slot) {
+    return isTagged(slot, KARST_RESOLVER_TAG_NETIF);
+  });
+  require(static_cast<size_t>(inUse), model_->slots.size(), "slots of interfaces", cache);
   if (!model_->enabled) return;
   if (!model_->dirty.empty())
     host::panic("lockstep: node %s is dirty and nobody works on it",

@@ -127,5 +127,6 @@ class Lockstep final : public sim::Observer {
   std::vector<Known *> alive_;
   size_t cacheSubscriptions_ = 0; /* of nodes and interfaces, whose last call has not returned */
   uint64_t checks_ = 0, sections_ = 0;
+  size_t sectionsSinceWhole_ = 0; /* all was compared */
   Counts counts_;
 };

@@ -145,11 +145,13 @@ struct Module::Impl : std::enable_shared_from_this<Module::Impl> {
 
   static std::mutex keptLock;
   static bool keeping;
+  static std::function<bool()> outOfReach;        /* of the embedder; or none */
   static std::vector<std::shared_ptr<Impl>> kept; /* mapped for good, loaded or not */
 };
 
 std::mutex Module::Impl::keptLock;
 bool Module::Impl::keeping = false;
+std::function<bool()> Module::Impl::outOfReach;
 std::vector<std::shared_ptr<Module::Impl>> Module::Impl::kept;
 
 std::shared_ptr<Module::Impl> Module::Impl::keptAt(const std::filesystem::path &path) {
@@ -183,9 +185,10 @@ void Module::Impl::keep(const ElfImage &image) {
   kept.push_back(shared_from_this());
 }
 
-void keepUnloadedModules() {
+void keepUnloadedModules(std::function<bool()> outOfReach) {
   const std::lock_guard guard(Module::Impl::keptLock);
   Module::Impl::keeping = true;
+  Module::Impl::outOfReach = std::move(outOfReach);
 }
 
 void revealKeptModules() {
@@ -214,8 +217,10 @@ void Module::Impl::map() {
 
 void Module::Impl::unmap() {
   loaded = false;
-  if (memory)
-    return memory->withdraw(); /* it still lies there: for reports, and nobody binds to it */
+  if (memory) { /* it still lies there: for reports, and nobody binds to it */
+    if (!outOfReach || outOfReach()) memory->withdraw();
+    return;
+  }
   removeMappedModule(&mapped);
   dlclose(handle);
   handle = nullptr;

@@ -36,7 +36,7 @@ class Module {
 
  private:
   friend class ModuleLoader;
-  friend void keepUnloadedModules();
+  friend void keepUnloadedModules(std::function<bool()> outOfReach);
   friend void revealKeptModules();
   struct Impl;
   explicit Module(std::shared_ptr<Impl> impl);
@@ -73,8 +73,10 @@ class ModuleLoader {
 /* For a program that loads one module again and again: from now on a module stays mapped when it is
  * unloaded, out of reach of everybody, and its next load begins with its variables as the dynamic
  * linker first filled them in. Its init_module and cleanup_module run each time. Not kept are
- * modules with constructors, which run only when they are mapped, and modules that use another. */
-void keepUnloadedModules();
+ * modules with constructors, which run only when they are mapped, and modules that use another.
+ * That nobody can reach them takes system calls: `outOfReach` is asked at each unload whether it is
+ * worth them; without it, it always is. */
+void keepUnloadedModules(std::function<bool()> outOfReach = {});
 
 /* So that the report of a call into a kept module can name what lies there. */
 void revealKeptModules();

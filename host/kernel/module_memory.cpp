@@ -9,6 +9,7 @@
 #include <cstdio>
 #include <cstring>
 #include <fstream>
+#include <utility>
 
 #include "host/kernel/panic.h"
 
@@ -46,7 +47,8 @@ ModuleMemory::ModuleMemory(uintptr_t base, size_t size) {
   if (pages_.empty()) panic("the pages of a module are not known");
 }
 
-void ModuleMemory::withdraw() const {
+void ModuleMemory::withdraw() {
+  withdrawn_ = true;
   protect(pages_.front().begin, pages_.back().begin + pages_.back().size, PROT_NONE);
 }
 
@@ -54,9 +56,10 @@ void ModuleMemory::reveal() const {
   protect(pages_.front().begin, pages_.back().begin + pages_.back().size, PROT_READ);
 }
 
-void ModuleMemory::renew() const {
+void ModuleMemory::renew() {
+  const bool outOfReach = std::exchange(withdrawn_, false);
   for (const Pages &pages : pages_) {
-    protect(pages.begin, pages.begin + pages.size, pages.protection);
+    if (outOfReach) protect(pages.begin, pages.begin + pages.size, pages.protection);
     std::memcpy(reinterpret_cast<void *>(pages.begin), pages.content.data(), pages.content.size());
   }
 }

@@ -15,9 +15,9 @@ class ModuleMemory {
   /* Takes the memory as it is now for what it begins with. */
   ModuleMemory(uintptr_t base, size_t size);
 
-  void withdraw() const; /* who reads, writes or runs it from here on crashes */
-  void reveal() const;   /* it can be read, for a report */
-  void renew() const;    /* as at first: its variables, and what can be done with it */
+  void withdraw();     /* who reads, writes or runs it from here on crashes */
+  void reveal() const; /* it can be read, for a report */
+  void renew();        /* as at first: its variables, and what can be done with it */
 
  private:
   /* What can be written is apart. Of the rest all can be run, where some of it can: a system call
@@ -29,6 +29,7 @@ class ModuleMemory {
     std::string content; /* of what can be written */
   };
 
+  bool withdrawn_ = false;
   std::vector<Pages> pages_; /* one behind the other, without a gap */
 };
 

@@ -21,6 +21,7 @@
 
 #include "host/kernel/module_loader.h"
 #include "host/kernel/panic.h"
+#include "sim/access/access.h"
 #include "sim/sanitizers.h"
 #include "sim/scheduler.h"
 
@@ -37,8 +38,11 @@ namespace {
 constexpr int looksInPatience = 4;
 constexpr unsigned reportSeconds = 20; /* for the report of one that is stuck or has crashed */
 
+constexpr uint64_t sparingRuns = 8; /* one of so many is not sparing after all */
+
 uint64_t runsBegun = 0;
 double patienceSeconds = 0;
+bool outOfReach = true; /* modules that are unloaded in this run */
 
 /* The report may hang in its turn, in a lock that the interrupted code holds. */
 void endSoon() {
@@ -77,7 +81,7 @@ void keepMemory() {
   constexpr int kept = 32 << 20; /* the most that malloc allows */
   mallopt(M_MMAP_THRESHOLD, kept);
   mallopt(M_TRIM_THRESHOLD, kept);
-  host::keepUnloadedModules();
+  host::keepUnloadedModules([] { return access::watching || outOfReach; });
 }
 
 void watch(std::chrono::milliseconds patience) {
@@ -190,7 +194,8 @@ void Crew::become(const Member &member, const std::function<void()> &work) {
   _exit(0);
 }
 
-void Crew::beginRun() {
+void Crew::beginRun(bool sparing) {
+  outOfReach = !sparing || runsBegun % sparingRuns == 0;
   ++runsBegun;
   if (lseek(STDERR_FILENO, 0, SEEK_CUR) == 0) return;
   if (lseek(STDERR_FILENO, 0, SEEK_SET) != 0 || ftruncate(STDERR_FILENO, 0) != 0)

@@ -131,7 +131,7 @@ void Search::playRuns(const Chances &chances, uint64_t runs, Slot &slot) {
     const uint64_t run = board_->next++;
     if (run >= runs) return;
     slot.run = run;
-    Crew::beginRun();
+    Crew::beginRun(true);
     const Case played = caseOf(chances, run);
     const Outcome outcome = play(played, playing_);
     if (chances.twice) requireEqual(outcome, play(played, playing_));
@@ -170,7 +170,7 @@ void Search::playSchedules(const Case &searched, uint32_t share, uint32_t preemp
     BoundedSearch search(bound, share, crew_.jobs());
     do {
       if (spent()) return;
-      Crew::beginRun();
+      Crew::beginRun(true);
       log.clear();
       Recorder recorder(search, log);
       const Outcome outcome =

@@ -94,7 +94,10 @@ void Lockstep::moduleComesOrGoes() {
 }
 
 void Lockstep::moduleIsGone() {
-  activities_.clear();
+  end(simulation_.scheduler().running());
+  if (!activities_.empty())
+    host::panic("lockstep: the module is gone, and fiber %u is still inside it",
+                activities_.front().fiber);
   cache_ = nullptr;
   if (!alive_.empty()) host::panic("lockstep: the module is gone, and an instance is not");
   if (model_ && (!model_->nodes.empty() || !model_->slots.empty() || cacheSubscriptions_ != 0))

@@ -62,7 +62,30 @@ bool isAt(const Element &element, const Slot &slot) {
   return element.slot ? element.slot == &slot : element.uuid == slot.uuid;
 }
 
-/* A list begins and ends with those that it should. `links`: where an element has its own. */
+template <typename Element, typename Slot>
+void requireAt(const Element &element, const Slot &slot) {
+  if (!isAt(element, slot))
+    host::panic("lockstep: %s stands on a list where %s should", name(slot.uuid).c_str(),
+                name(element.uuid).c_str());
+}
+
+/* Each on a list beside the one that it should be. `links`: where an element has its own. */
+template <typename Real, typename Wanted, typename Compare>
+void compareList(const Wanted &wanted, const KARSTResolverLink &head, size_t links,
+                 const char *what, const zel_UUID &whose, Compare compare) {
+  auto next = wanted.begin();
+  for (KARSTResolverLink *link = head.next; link != &head; link = link->next) {
+    if (next == wanted.end())
+      host::panic("lockstep: there are more %s of %s than there should be", what,
+                  name(whose).c_str());
+    compare(**next++, *reinterpret_cast<Real *>(reinterpret_cast<uint8_t *>(link) - links));
+  }
+  if (next != wanted.end())
+    host::panic("lockstep: there are fewer %s of %s than there should be", what,
+                name(whose).c_str());
+}
+
+/* A list begins and ends with those that it should. */
 template <typename Real, typename Wanted>
 void requireEnds(const Wanted &wanted, const KARSTResolverLink &head, size_t links,
                  const char *what) {
@@ -503,25 +526,12 @@ void Lockstep::compareWhole() {
   }
   require(inUse, model_->nodes.size(), "nodes", cache);
 
-  auto netIf = model_->netIfs.begin();
-  for (const KARSTResolverLink *link = cache_->netIfs.next; link != &cache_->netIfs;
-       link = link->next) {
-    if (netIf == model_->netIfs.end())
-      host::panic("lockstep: more interfaces than there should be");
-    compareNetIf(**netIf++, *KARST_RESOLVER_CONTAINER(link, KARSTResolverNetIf, cacheLinks));
-  }
-  if (netIf != model_->netIfs.end()) host::panic("lockstep: fewer interfaces than there should be");
-
-  auto dirty = model_->dirty.begin();
-  for (const KARSTResolverLink *link = cache_->dirtyNodes.next; link != &cache_->dirtyNodes;
-       link = link->next) {
-    const auto &real = *KARST_RESOLVER_CONTAINER(link, KARSTResolverNode, dirtyLinks);
-    if (dirty == model_->dirty.end() || !isAt(**dirty++, real))
-      host::panic("lockstep: node %s stands where it should not in the dirty queue",
-                  name(real.uuid).c_str());
-  }
-  if (dirty != model_->dirty.end())
-    host::panic("lockstep: node %s should be in the dirty queue", name((*dirty)->uuid).c_str());
+  compareList<KARSTResolverNetIf>(
+      model_->netIfs, cache_->netIfs, offsetof(KARSTResolverNetIf, cacheLinks), "interfaces", cache,
+      [&](model::NetIf &netIf, KARSTResolverNetIf &real) { compareNetIf(netIf, real); });
+  compareList<KARSTResolverNode>(model_->dirty, cache_->dirtyNodes,
+                                 offsetof(KARSTResolverNode, dirtyLinks), "dirty nodes", cache,
+                                 requireAt<model::Node, KARSTResolverNode>);
 }
 
 /* A new one is looked for: any slot may be its. */
@@ -556,15 +566,14 @@ void Lockstep::compareNode(model::Node &node, const KARSTResolverNode &real) {
   require<int>(real.dirtyLinks.next != nullptr, node.dirty, "dirty", uuid);
   require(real.majorVersion, node.major, "majorVersion", uuid);
   require(real.minorVersion, node.minor, "minorVersion", uuid);
-  auto netIf = node.netIfs.begin();
-  for (const KARSTResolverLink *link = real.netIfList.next; link != &real.netIfList;
-       link = link->next)
-    if (netIf == node.netIfs.end() ||
-        !isAt(**netIf++, *KARST_RESOLVER_CONTAINER(link, KARSTResolverNetIf, nodeLinks)))
-      host::panic("lockstep: the interfaces of %s are out of order", name(uuid).c_str());
-  if (netIf != node.netIfs.end())
-    host::panic("lockstep: node %s has fewer interfaces than it should", name(uuid).c_str());
-  compareInstances(node.instances, real.instanceList);
+  compareList<KARSTResolverNetIf>(node.netIfs, real.netIfList,
+                                  offsetof(KARSTResolverNetIf, nodeLinks), "interfaces", uuid,
+                                  requireAt<model::NetIf, KARSTResolverNetIf>);
+  compareList<KARSTResolverInstance>(node.instances, real.instanceList,
+                                     offsetof(KARSTResolverInstance, nodeLinks), "instances", uuid,
+                                     [](model::Instance &instance, KARSTResolverInstance &own) {
+                                       compareInstance(known(instance), own);
+                                     });
   if (!node.set.is(node.set.state, real.locators))
     host::panic("lockstep: the locators of %s are \"%s\", and should be \"%s\"", name(uuid).c_str(),
                 model::Answer::of(node.set.state, real.locators).text().c_str(),
@@ -585,19 +594,6 @@ void Lockstep::compareNetIf(model::NetIf &netIf, const KARSTResolverNetIf &real)
   require(real.health.healthFlags, netIf.health.healthFlags, "healthFlags", uuid);
   if (std::memcmp(&real.info, &netIf.info, sizeof real.info) != 0)
     host::panic("lockstep: the record of interface %s differs", name(uuid).c_str());
-}
-
-void Lockstep::compareInstances(const std::vector<model::Instance *> &instances,
-                                const KARSTResolverLink &head) {
-  auto instance = instances.begin();
-  for (const KARSTResolverLink *link = head.next; link != &head; link = link->next) {
-    if (instance == instances.end())
-      host::panic("lockstep: a node has more instances than it should");
-    compareInstance(known(**instance++),
-                    *KARST_RESOLVER_CONTAINER(link, KARSTResolverInstance, nodeLinks));
-  }
-  if (instance != instances.end())
-    host::panic("lockstep: a node has fewer instances than it should");
 }
 
 void Lockstep::compareInstance(Known &instance, KARSTResolverInstance &real) {

@@ -111,9 +111,7 @@ class Lockstep final : public sim::Observer {
   void compareNetIf(model::NetIf &netIf, const KARSTResolverNetIf &real);
   const KARSTResolverNode &realOf(const model::Node &node) const;
   const KARSTResolverNetIf &realOf(const model::NetIf &netIf) const;
-  void compareInstances(const std::vector<model::Instance *> &instances,
-                        const KARSTResolverLink &head);
-  void compareInstance(Known &instance, KARSTResolverInstance &real);
+  static void compareInstance(Known &instance, KARSTResolverInstance &real);
   static void requireAnswer(const Known &instance);
   model::Instance &instanceOf(const void *real);
   static Known &known(model::Instance &instance) { return static_cast<Known &>(instance); }

@@ -347,7 +347,7 @@ sim::Outcome Tabled::play(const Plan &plan, const sim::Run &run) const {
     const bool searched = !small() || phase > 1;
     if (searched) simulation.setStrategy(std::make_unique<sim::Borrowed>(*run.strategy));
     playPhase(cluster, {begin, end});
-    cluster.rest(!searched && isKnown(plan, phase, settings.witness));
+    cluster.rest(!searched && !sim::access::watching && isKnown(plan, phase, settings.witness));
     begin = end;
   }
   if (small()) simulation.setSwitching(sim::Switching::WhenBlocked);

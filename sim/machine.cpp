@@ -182,8 +182,7 @@ PlatformCall::PlatformCall(Call call, const Argument &argument, const void *call
   recorded_ = !nested || traits(call).fault != ZEL_OK;
   if (!recorded_) return;
   Scheduler &scheduler = machine_.scheduler_;
-  scheduler.mix(static_cast<uint64_t>(call) << 32 | fiber_.id());
-  scheduler.mix(argument.hash());
+  scheduler.mix((static_cast<uint64_t>(call) << 32 | fiber_.id()) + argument.hash());
   machine_.history_.follows(fiber_, call);
   if (!machine_.history_.keeps()) return;
   number_ = machine_.history_.begin({.step = scheduler.steps(),

@@ -111,7 +111,8 @@ const StackRange &ownStack() {
 
 }  // namespace
 
-Scheduler::Scheduler(std::unique_ptr<Strategy> strategy) : strategy_(std::move(strategy)) {
+Scheduler::Scheduler(std::unique_ptr<Strategy> strategy)
+    : strategy_(std::move(strategy)), exceptionState_(abi::__cxa_get_globals()) {
   if (instance_) host::panic("a second simulation while the first one is still there");
   instance_ = this;
   driver_.name_ = intern("driver");
@@ -192,9 +193,8 @@ void Scheduler::switchTo(Fiber &next) {
   current_ = &next;
   /* What is being thrown and caught belongs to the fiber, but the C++ runtime keeps it by thread.
    */
-  void *exceptionState = abi::__cxa_get_globals();
-  std::memcpy(previous.exceptionState_.data(), exceptionState, sizeof previous.exceptionState_);
-  std::memcpy(exceptionState, next.exceptionState_.data(), sizeof next.exceptionState_);
+  std::memcpy(previous.exceptionState_.data(), exceptionState_, sizeof previous.exceptionState_);
+  std::memcpy(exceptionState_, next.exceptionState_.data(), sizeof next.exceptionState_);
 
   sanitizers::beforeSwitch(previous.ended_ ? nullptr : &previous.fakeStack_, next.stackBottom_,
                            static_cast<size_t>(next.stackTop_ - next.stackBottom_));

@@ -107,6 +107,7 @@ class Scheduler {
 
   inline static Scheduler *instance_ = nullptr;
   std::unique_ptr<Strategy> strategy_;
+  void *const exceptionState_; /* the C++ runtime's, of the one thread; see Fiber */
   Fiber driver_;
   Fiber *current_ = &driver_;
   Fiber *last_ = nullptr; /* the fiber that ran before the driver, while it can go on */

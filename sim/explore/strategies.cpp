@@ -80,14 +80,15 @@ Pct::Pct(uint64_t seed, uint32_t depth, uint32_t length)
             [](const Change &a, const Change &b) { return a.choice > b.choice; });
 }
 
-uint64_t &Pct::priorityOf(const Fiber &fiber) {
+/* Inline, as it is asked for each fiber at each step. */
+inline uint64_t &Pct::priorityOf(const Fiber &fiber) {
   if (fiber.id() >= priorities_.size()) priorities_.resize(fiber.id() + 1);
   uint64_t &priority = priorities_[fiber.id()];
   if (priority == 0) priority = random_.next() | firstPriority;
   return priority;
 }
 
-Fiber &Pct::highest(std::span<Fiber *const> runnable) {
+inline Fiber &Pct::highest(std::span<Fiber *const> runnable) {
   Fiber *best = runnable.front();
   uint64_t most = priorityOf(*best);
   for (Fiber *fiber : runnable.subspan(1)) {

@@ -143,7 +143,7 @@ Answer Session::refusedAnswer(const Target &target, zel_Status status) {
 std::string Session::reasonOf(const Target &target, const std::optional<zel_UUID> &boundNode) {
   const Viewpoint view{kernel_.directory(), names_, witness_};
   /* The directory may have changed since the resolver answered. */
-  return whyUnresolved(view, target, boundNode).value_or("nothing in the directory explains it");
+  return whyUnresolved(view, target, boundNode).value_or(kUnexplained);
 }
 
 void Session::stopSources() {

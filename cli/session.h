@@ -65,6 +65,9 @@ class Session {
   Answer answerOf(const Target &target, KARSTResolverInstance *instance,
                   const std::optional<zel_UUID> &boundNode = {});
 
+  /* What is said when the directory, as it is by the time it is asked, gives no reason. */
+  static constexpr const char *kUnexplained = "nothing in the directory explains it";
+
   /* The answer to a target for which no instance could be made. */
   Answer refusedAnswer(const Target &target, zel_Status status);
 

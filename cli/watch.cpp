@@ -214,6 +214,8 @@ void Watch::retry(Watched &watched) {
     release(watched);
   }
   const auto refused = tryCreate(watched);
+  /* Why it was refused has gone meanwhile: that change is told next, and calls for another try. */
+  if (refused && refused->reason == Session::kUnexplained) return;
   if (refused && detailText(*refused, session_.names()) != watched.lastDetail) {
     printLine("retry", watched, *refused, std::chrono::system_clock::now());
   }

@@ -2,6 +2,8 @@
  * Calls nothing of the module, takes no lock. */
 #include "tests/directory_view.h"
 
+#include <fmt/format.h>
+
 #include <algorithm>
 #include <cstring>
 #include <functional>
@@ -131,33 +133,28 @@ void checkSlots(const Slot *pool, uint32_t size, const char *tag,
 
 /* What a client may rely on: of an IPv4 address four bytes count. */
 std::string textOf(const KARSTResolverNodeLocators &set) {
-  std::string text = formatText("%s, version %u.%u, traffic %llu,", toString(set.nodeUUID).c_str(),
-                                set.majorVersion, set.minorVersion,
-                                static_cast<unsigned long long>(set.trafficType));
+  std::string text = fmt::format("{}, version {}.{}, traffic {},", toString(set.nodeUUID),
+                                 set.majorVersion, set.minorVersion, set.trafficType);
   for (uint16_t i = 0; i < std::min<uint16_t>(set.count, KARST_RESOLVER_MAX_LOCATORS); i++) {
     const KARSTResolverNodeLocator &locator = set.locators[i];
     const size_t lengths[] = {0, 4, 16, 0}; /* by network type */
-    text += formatText(" %u:", locator.networkType);
-    for (size_t byte = 0; byte < lengths[locator.networkType & 3]; byte++) {
-      text += formatText("%02x", locator.address[byte]);
-    }
+    const uint8_t *end = locator.address + lengths[locator.networkType & 3];
+    text += fmt::format(" {}:{:02x}", locator.networkType, fmt::join(locator.address, end, ""));
   }
   return text;
 }
 
-std::string textOf(const KARSTResolverCache &cache) {
-  return formatText("enabled %d, references %llu, self %s", cache.enabled,
-                    static_cast<unsigned long long>(cache.refCount),
-                    toString(cache.selfUUID).c_str());
+std::string textOfCache(bool enabled, uint64_t references, const zel_UUID &self) {
+  return fmt::format("enabled {:d}, references {}, self {}", enabled, references, toString(self));
 }
 
 std::string textOf(const KARSTResolverNode &node, size_t netIfs, size_t instances) {
-  return formatText(
-             "references %u, interfaces %zu, instances %zu, reachable %d, self %d, witness %d, "
-             "mark of a rescan %d, room for %u locators, version %u.%u, ",
-             node.refCount, netIfs, instances, node.reachable, node.isSelf, node.isWitness,
-             node.rescanSeen, node.locators.capacity, node.majorVersion, node.minorVersion) +
-         textOf(node.locators);
+  return fmt::format(
+      "references {}, interfaces {}, instances {}, reachable {}, self {}, witness {}, mark of a "
+      "rescan {}, room for {} locators, version {}.{}, {}",
+      node.refCount, netIfs, instances, node.reachable, node.isSelf, node.isWitness,
+      node.rescanSeen, node.locators.capacity, node.majorVersion, node.minorVersion,
+      textOf(node.locators));
 }
 
 /* Of the records the hash: enough to tell them apart. */
@@ -165,18 +162,18 @@ std::string textOf(const KARSTResolverNetIf &netIf) {
   const auto hashOf = [](const auto &record) {
     return std::hash<std::string_view>()({reinterpret_cast<const char *>(&record), sizeof record});
   };
-  return formatText(
-      "references %u, record %zx, health record %zx, healthy %d, health subscription "
-      "%d, mark of a rescan %d",
+  return fmt::format(
+      "references {}, record {:x}, health record {:x}, healthy {}, health subscription {}, mark of "
+      "a rescan {}",
       netIf.refCount, hashOf(netIf.info), hashOf(netIf.health), netIf.healthy,
       netIf.healthSubInstalled, netIf.rescanSeen);
 }
 
 std::string textOf(const KARSTResolverInstance &instance, uint32_t told) {
-  return formatText("references %llu, destroyed %d, tracks %s, state %u, callback was told %u, %s",
-                    static_cast<unsigned long long>(instance.refCount), instance.destroyed,
-                    toString(instance.node ? instance.node->uuid : zel_UUID{}).c_str(),
-                    instance.state, told, textOf(instance.locators).c_str());
+  return fmt::format("references {}, destroyed {}, tracks {}, state {}, callback was told {}, {}",
+                     instance.refCount, instance.destroyed,
+                     toString(instance.node ? instance.node->uuid : zel_UUID{}), instance.state,
+                     told, textOf(instance.locators));
 }
 
 std::string nodeName(const zel_UUID &uuid) {
@@ -188,7 +185,7 @@ std::string netIfName(const zel_UUID &owner, const zel_UUID &uuid) {
 }
 
 Picture pictureOf(const KARSTResolverCache *cache, const DirectoryView &view, Lines &lines) {
-  Picture picture{{"cache", textOf(*cache)}};
+  Picture picture{{"cache", textOfCache(cache->enabled, cache->refCount, cache->selfUUID)}};
   for (const KARSTResolverNode *node : nodesOf(cache, lines)) {
     const auto instances = elementsOf<KARSTResolverInstance>(
         node->instanceList, offsetof(KARSTResolverInstance, nodeLinks),
@@ -212,16 +209,13 @@ Picture pictureOf(const KARSTResolverCache *cache, const DirectoryView &view, Li
 class Expected {
  public:
   Expected(const KARSTResolverCache *cache, const DirectoryView &view, Lines &lines)
-      : cache_(cache), view_(view), lines_(lines) {
+      : view_(view), lines_(lines) {
     for (const KARSTResolverNode *node : nodesOf(cache, lines)) cached_[node->uuid] = node;
   }
 
   Picture picture() {
-    KARSTResolverCache cache = *cache_;
-    cache.enabled = 1;
-    cache.refCount = 2 + view_.netIfs.size() + view_.instances.size();
-    cache.selfUUID = view_.self;
-    Picture picture{{"cache", textOf(cache)}};
+    const uint64_t references = 2 + view_.netIfs.size() + view_.instances.size();
+    Picture picture{{"cache", textOfCache(true, references, view_.self)}};
     std::set<zel_UUID> nodes;
     for (const auto &[uuid, record] : view_.nodes) nodes.insert(uuid);
     for (const auto &[pairing, netIf] : view_.netIfs) {
@@ -337,7 +331,6 @@ class Expected {
     if (info.numIpAddresses == 0 && hasSingle) add(false, info.ipv4Address);
   }
 
-  const KARSTResolverCache *cache_;
   const DirectoryView &view_;
   Lines &lines_;
   std::map<zel_UUID, const KARSTResolverNode *> cached_;
@@ -383,8 +376,7 @@ DirectoryView viewOf(const host::Directory &directory, const zel_UUID &self, boo
   return view;
 }
 
-Lines differencesOf(const KARSTResolverCache *cache, const DirectoryView &view,
-                    const SlotSample &sample) {
+Lines damageOf(const KARSTResolverCache *cache, const SlotSample &sample) {
   Lines lines;
   const Nodes nodes = nodesOf(cache, lines);
   const NetIfs netIfs = netIfsOf(cache, lines);
@@ -392,9 +384,15 @@ Lines differencesOf(const KARSTResolverCache *cache, const DirectoryView &view,
              cache->freeNodes, sample, lines);
   checkSlots(cache->netIfPool, KARST_RESOLVER_NETIF_POOL_SIZE, KARST_RESOLVER_TAG_NETIF, netIfs,
              cache->freeNetIfs, sample, lines);
-  if (cache->dirtyNodes.next != &cache->dirtyNodes) lines.push_back("dirty nodes");
   if (!isTag(cache->tag, KARST_RESOLVER_TAG_CACHE)) lines.push_back("cache: its tag is wrong");
+  return lines;
+}
+
+Lines differencesOf(const KARSTResolverCache *cache, const DirectoryView &view,
+                    const SlotSample &sample) {
+  Lines lines = damageOf(cache, sample);
   if (!lines.empty()) return lines; /* what follows relies on it */
+  if (cache->dirtyNodes.next != &cache->dirtyNodes) lines.push_back("dirty nodes");
 
   Picture found = pictureOf(cache, view, lines);
   for (const auto &[name, text] : Expected(cache, view, lines).picture()) {

@@ -47,9 +47,12 @@ struct SlotSample {
   size_t first = 0;
 };
 
-/* What is broken in the cache itself (tree, lists, slots, tags), or else every difference of an
- * enabled cache from the view, a line each; none: they are equal. To be asked when nothing is due any
- * more. Needs a directory that fits into the cache's slots. A new version or witness flag of a node
- * alone changes no locators: have each such node marked dirty before. */
+/* What is broken in the cache itself (tree, lists, slots, tags), a line each. */
+std::vector<std::string> damageOf(const KARSTResolverCache *cache, const SlotSample &sample = {});
+
+/* Damage, or else every difference of an enabled cache from the view, a line each; none: they are
+ * equal. To be asked when nothing is due any more. Needs a directory that fits into the cache's slots.
+ * A new version or witness flag of a node alone changes no locators: have each such node marked dirty
+ * before. */
 std::vector<std::string> differencesOf(const KARSTResolverCache *cache, const DirectoryView &view,
                                        const SlotSample &sample = {});

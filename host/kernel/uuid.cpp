@@ -22,12 +22,12 @@ std::optional<uint8_t> digitValue(char digit) {
 
 std::string toString(const zel_UUID &uuid) {
   static const char digits[] = "0123456789abcdef";
-  std::string text;
-  text.reserve(kTextLength);
+  std::string text(kTextLength, '-');
+  size_t place = 0;
   for (uint8_t byte : uuid.bytes) {
-    if (isDashPlace(text.size())) text += '-';
-    text += digits[byte >> 4];
-    text += digits[byte & 0xf];
+    place += isDashPlace(place);
+    text[place++] = digits[byte >> 4];
+    text[place++] = digits[byte & 0xf];
   }
   return text;
 }

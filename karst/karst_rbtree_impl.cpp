@@ -74,6 +74,10 @@ void SetChild(Links links, uint64_t link, Side side, uint64_t child) {
 bool IsRed(Links links, uint64_t link) {
   return (At(links, link)->word & KARSTRBTREE_NODE_RED) != 0;
 }
+/* By one branch: which of them is red is anybody's guess. */
+bool EitherIsRed(Links links, uint64_t link, uint64_t other) {
+  return ((At(links, link)->word | At(links, other)->word) & KARSTRBTREE_NODE_RED) != 0;
+}
 void SetRed(Links links, uint64_t link) {
   At(links, link)->word |= KARSTRBTREE_NODE_RED;
 }
@@ -210,7 +214,7 @@ void RemoveFixUp(Links links, uint64_t *root, uint64_t link) {
     }
     uint64_t nearChild = Child(links, sibling, side);
     uint64_t farChild = Child(links, sibling, Opposite(side));
-    if (!(IsRed(links, nearChild) | IsRed(links, farChild))) {
+    if (!EitherIsRed(links, nearChild, farChild)) {
       SetRed(links, sibling);
       link = parent;
       continue;
@@ -534,8 +538,7 @@ void KARSTRBTree_Remove(KARSTRBTree *tree, KARSTRBTreeNode *node) {
   }
 
   /* `leaver` gives up its position: the node itself, or its successor, which has no left child and
-   * then takes the node's place as a whole. `orphan` is its only possible child. Which node has which
-   * children and colours is anybody's guess, so few branches ask for it. */
+   * then takes the node's place as a whole. `orphan` is its only possible child. */
   Links links = LinksOf(tree);
   uint64_t *root = &tree->data->root;
   uint64_t link = LinkTo(links, node);
@@ -549,7 +552,7 @@ void KARSTRBTree_Remove(KARSTRBTree *tree, KARSTRBTreeNode *node) {
   uint64_t parent = Parent(links, leaver);
   SetParent(links, orphan, parent); /* the nil's too: the fix-up climbs from it */
   ReplaceBelow(links, root, parent, leaver, orphan);
-  if (IsRed(links, leaver) | IsRed(links, orphan)) { /* a red leaver's orphan is black already */
+  if (EitherIsRed(links, leaver, orphan)) { /* a red leaver's orphan is black already */
     SetBlack(links, orphan);
   } else {
     RemoveFixUp(links, root, orphan);

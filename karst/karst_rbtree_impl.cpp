@@ -152,8 +152,9 @@ inline uint64_t AncestorTowards(Links links, uint64_t link, Side side) {
   return ancestor;
 }
 
-/* The neighbour in order on one side, or the nil. */
-uint64_t Neighbour(Links links, uint64_t link, Side side) {
+/* The neighbour in order on one side, or the nil. Compiled into its caller: a removal knows that there
+ * is a child. */
+__attribute__((always_inline)) inline uint64_t Neighbour(Links links, uint64_t link, Side side) {
   uint64_t child = Child(links, link, side);
   return child == links.nil ? AncestorTowards(links, link, side)
                             : Outermost(links, child, Opposite(side));
@@ -544,7 +545,7 @@ void KARSTRBTree_Remove(KARSTRBTree *tree, KARSTRBTreeNode *node) {
   uint64_t link = LinkTo(links, node);
   uint64_t leaver = link;
   if (node->left != links.nil && node->right != links.nil) {
-    leaver = Outermost(links, node->right, LEFT);
+    leaver = RbtTreeSuccessor(links, link);
   }
   uint64_t left = Child(links, leaver, LEFT);
   uint64_t right = Child(links, leaver, RIGHT);

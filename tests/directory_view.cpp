@@ -31,11 +31,13 @@ bool isTag(const char *tag, const char *text, bool isFree = false) {
   return found == (isFree ? ~wanted : wanted);
 }
 
-/* The structures on a list, whose links must lead the same way forth and back. */
-template <typename Element>
+/* The structures on a list, whose links must lead the same way forth and back. `name` is asked for
+ * the list's when they don't. */
+template <typename Element, typename Name>
 std::vector<const Element *> elementsOf(const KARSTResolverLink &head, size_t offset,
-                                        const std::string &what, Lines &lines) {
+                                        const Name &name, Lines &lines) {
   std::vector<const Element *> elements;
+  elements.reserve(32);
   const KARSTResolverLink *previous = &head;
   const KARSTResolverLink *link = head.next;
   while (link != &head && link != nullptr && link->previous == previous && elements.size() < 1000) {
@@ -44,18 +46,20 @@ std::vector<const Element *> elementsOf(const KARSTResolverLink &head, size_t of
     previous = link;
     link = link->next;
   }
-  if (link != &head || head.previous != previous) lines.push_back(what + ": a broken list");
+  if (link != &head || head.previous != previous) lines.push_back(name() + ": a broken list");
   return elements;
 }
 
 NetIfs netIfsOf(const KARSTResolverNode &node, Lines &lines) {
-  return elementsOf<KARSTResolverNetIf>(node.netIfList, offsetof(KARSTResolverNetIf, nodeLinks),
-                                        "interfaces of node " + toString(node.uuid), lines);
+  return elementsOf<KARSTResolverNetIf>(
+      node.netIfList, offsetof(KARSTResolverNetIf, nodeLinks),
+      [&] { return "interfaces of node " + toString(node.uuid); }, lines);
 }
 
 NetIfs netIfsOf(const KARSTResolverCache *cache, Lines &lines) {
-  return elementsOf<KARSTResolverNetIf>(cache->netIfs, offsetof(KARSTResolverNetIf, cacheLinks),
-                                        "interfaces", lines);
+  return elementsOf<KARSTResolverNetIf>(
+      cache->netIfs, offsetof(KARSTResolverNetIf, cacheLinks),
+      [] { return std::string("interfaces"); }, lines);
 }
 
 /* How many black nodes every path below a link passes, and the nodes in order; -1: it is no such
@@ -109,24 +113,24 @@ template <typename Slot>
 void checkSlots(const Slot *pool, uint32_t size, const char *tag,
                 const std::vector<const Slot *> &used, const KARSTResolverLink &freeList,
                 const SlotSample &sample, Lines &lines) {
-  const std::string what = std::string(tag, 8) + " slots";
+  const auto what = [&] { return std::string(tag, 8) + " slots"; };
   const auto free = elementsOf<Slot>(freeList, offsetof(Slot, freeLinks), what, lines);
   const auto placesOf = [&](const std::vector<const Slot *> &slots) {
-    std::vector<bool> places(size);
+    std::vector<char> places(size);
     for (const Slot *slot : slots) {
       if (slot >= pool && slot < pool + size) places[static_cast<size_t>(slot - pool)] = true;
     }
     return places;
   };
-  const std::vector<bool> listed = placesOf(free), inUse = placesOf(used);
+  const std::vector<char> listed = placesOf(free), inUse = placesOf(used);
   for (uint32_t i = 0; i < size; i++) {
     const bool lookInto = !inUse[i] && i % sample.step == sample.first;
     if (listed[i] == inUse[i] || !isTag(pool[i].tag, tag, !inUse[i]) ||
         (lookInto && !isEmpty(pool[i]))) {
-      lines.push_back(formatText("%s: %u is neither in use nor free", what.c_str(), i));
+      lines.push_back(formatText("%s: %u is neither in use nor free", what().c_str(), i));
     }
   }
-  if (free.size() + used.size() != size) lines.push_back(what + ": some are not in the pool");
+  if (free.size() + used.size() != size) lines.push_back(what() + ": some are not in the pool");
 }
 
 /* ---- Pictures -------------------------------------------------------------------------------- */
@@ -189,7 +193,7 @@ Picture pictureOf(const KARSTResolverCache *cache, const DirectoryView &view, Li
   for (const KARSTResolverNode *node : nodesOf(cache, lines)) {
     const auto instances = elementsOf<KARSTResolverInstance>(
         node->instanceList, offsetof(KARSTResolverInstance, nodeLinks),
-        "instances of " + nodeName(node->uuid), lines);
+        [&] { return "instances of " + nodeName(node->uuid); }, lines);
     picture[nodeName(node->uuid)] = textOf(*node, netIfsOf(*node, lines).size(), instances.size());
   }
   for (const KARSTResolverNetIf *netIf : netIfsOf(cache, lines)) {

@@ -39,7 +39,8 @@ CallbackTable::~CallbackTable() = default;
 zel_Status CallbackTable::subscribe(host::Directory &directory, const KarstQuery *query,
                                     KarstSubscriptionFn fn, void *data) {
   if (!query || !fn) return ZEL_BAD_PARAM;
-  Subscription &made = subscriptions_.emplace_back(this, query, fn, data, query->type);
+  subscriptions_.push_back({this, query, fn, data, query->type, {}});
+  Subscription &made = subscriptions_.back();
   made.place = std::prev(subscriptions_.end());
   access::publish(&made);
   const zel_Status status = directory.subscribe(query, &callSubscriber, &made);

@@ -199,7 +199,9 @@ using namespace host;
 
 extern "C" {
 
-int32_t Trace_ClassLevelGet(uint32_t traceClass) {
+/* Asked at every trace statement: in one window of the processor's decoder, wherever the linker puts
+ * it. Across two, it takes half as long again. */
+__attribute__((aligned(32))) int32_t Trace_ClassLevelGet(uint32_t traceClass) {
   if (traceClass >= kClasses) return kNoSuchClass;
   return levels[traceClass].load(std::memory_order_relaxed);
 }

@@ -10,6 +10,7 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <new>
 
 #include "host/kernel/log.h"
 #include "host/kernel/module_loader.h"

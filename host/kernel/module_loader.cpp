@@ -164,14 +164,17 @@ std::shared_ptr<Module::Impl> Module::Impl::keptAt(const std::filesystem::path &
 }
 
 /* One that is kept is mostly loaded by the same path again: the system need not be asked where that
- * leads. */
+ * leads. A relative one may lead elsewhere by now. */
 std::shared_ptr<Module::Impl> Module::Impl::of(const std::filesystem::path &path) {
   const std::lock_guard guard(keptLock);
-  if (auto known = keptAt(path)) return known;
+  if (path.is_absolute()) {
+    if (auto known = keptAt(path)) return known;
+  }
   std::error_code error;
   const auto canonical = std::filesystem::canonical(path, error);
+  if (error) return std::make_shared<Impl>(path); /* reading it says what is wrong */
   if (auto known = keptAt(canonical)) return known;
-  auto made = std::make_shared<Impl>(error ? path : canonical);
+  auto made = std::make_shared<Impl>(canonical);
   made->asked = path;
   return made;
 }

@@ -213,9 +213,11 @@ void Watch::retry(Watched &watched) {
     if (session_.answerOf(watched.target, watched.instance).locators) return;
     release(watched);
   }
-  const auto refused = tryCreate(watched);
-  /* Why it was refused has gone meanwhile: that change is told next, and calls for another try. */
-  if (refused && refused->reason == Session::kUnexplained) return;
+  auto refused = tryCreate(watched);
+  if (refused && refused->reason == Session::kUnexplained) { /* the reason has gone meanwhile */
+    session_.settle();
+    refused = tryCreate(watched);
+  }
   if (refused && detailText(*refused, session_.names()) != watched.lastDetail) {
     printLine("retry", watched, *refused, std::chrono::system_clock::now());
   }

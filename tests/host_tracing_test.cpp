@@ -25,9 +25,10 @@ extern "C" uint64_t zel_GetTimerCycles(void) {
 extern "C" uint64_t zel_TimerTCToNS(uint64_t cycles) {
   return cycles / 2;
 }
-uint64_t host::tickNanoseconds() {
-  return clockNanoseconds / tick * tick;
-}
+constinit host::SystemClock host::systemClock = [](clockid_t, timespec *now) {
+  *now = {0, static_cast<long>(clockNanoseconds / tick * tick)};
+  return 0;
+};
 uint64_t host::tickInterval() {
   return tick;
 }

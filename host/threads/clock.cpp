@@ -20,24 +20,16 @@
 
 namespace host {
 
+constinit SystemClock systemClock = clock_gettime;
+
 namespace {
 
 constexpr uint64_t kSecond = 1'000'000'000;
 
-using Clock = decltype(clock_gettime);
-constinit Clock *getTime = clock_gettime;
-
-/* The kernel's own function, without the C library's around it: a call less. */
-Clock *kernelsClock() {
+SystemClock kernelsClock() {
   void *const vdso = dlopen("linux-vdso.so.1", RTLD_NOW | RTLD_NOLOAD);
   void *const clock = vdso == nullptr ? nullptr : dlsym(vdso, "__vdso_clock_gettime");
-  return clock == nullptr ? clock_gettime : reinterpret_cast<Clock *>(clock);
-}
-
-uint64_t read(clockid_t clock) {
-  timespec now{};
-  getTime(clock, &now);
-  return static_cast<uint64_t>(now.tv_sec) * kSecond + static_cast<uint64_t>(now.tv_nsec);
+  return clock == nullptr ? clock_gettime : reinterpret_cast<SystemClock>(clock);
 }
 
 /* One moment, as both clocks give it. */
@@ -51,7 +43,7 @@ Moment currentMoment() {
   uint64_t least = UINT64_MAX;
   for (int i = 0; i < 16; ++i) {
     const uint64_t before = __rdtsc();
-    const uint64_t nanoseconds = read(CLOCK_MONOTONIC);
+    const uint64_t nanoseconds = readClock(CLOCK_MONOTONIC);
     const uint64_t took = __rdtsc() - before;
     if (took >= least) continue;
     least = took;
@@ -84,7 +76,7 @@ Scale measuredScale() {
   Scale scale;
   if (!kernelGoesByCounter()) return scale;
   const Moment start = currentMoment();
-  while (read(CLOCK_MONOTONIC) - start.nanoseconds < kMeasured) {
+  while (readClock(CLOCK_MONOTONIC) - start.nanoseconds < kMeasured) {
   }
   const Moment end = currentMoment();
   scale.counter = true;
@@ -98,13 +90,10 @@ Scale measuredScale() {
 constinit Scale scale;
 
 /* Before main, while there is one thread; until then the monotonic clock serves. */
-[[maybe_unused]] const bool madeReady = (getTime = kernelsClock(), scale = measuredScale(), true);
+[[maybe_unused]] const bool madeReady =
+    (systemClock = kernelsClock(), scale = measuredScale(), true);
 
 }  // namespace
-
-uint64_t tickNanoseconds() {
-  return read(CLOCK_MONOTONIC_COARSE);
-}
 
 uint64_t tickInterval() {
   timespec interval{};
@@ -115,7 +104,7 @@ uint64_t tickInterval() {
 }  // namespace host
 
 extern "C" uint64_t zel_GetTimerCycles(void) {
-  return host::scale.counter ? __rdtsc() : host::read(CLOCK_MONOTONIC);
+  return host::scale.counter ? __rdtsc() : host::readClock(CLOCK_MONOTONIC);
 }
 
 extern "C" uint64_t zel_TimerTCToNS(uint64_t cycles) {

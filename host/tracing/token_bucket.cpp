@@ -52,7 +52,8 @@ Gathering gatheringOf(const TokenRate &rate) {
 
 /* The time that refills go by. For a bucket without refills it stands still. */
 inline int64_t timeOf(const Gathering &gathering) {
-  if (gathering.pace == Pace::Ticks) return static_cast<int64_t>(tickNanoseconds());
+  if (gathering.pace == Pace::Ticks) [[likely]]
+    return static_cast<int64_t>(tickNanoseconds());
   if (gathering.pace == Pace::Still) return 0;
   return static_cast<int64_t>(zel_TimerTCToNS(zel_GetTimerCycles()));
 }
@@ -67,10 +68,9 @@ uint64_t tokensSince(int64_t moment, const Gathering &gathering, int64_t now) {
   return gathered < gathering.interval ? 0 : static_cast<uint64_t>(gathered / gathering.interval);
 }
 
-/* In line for either kind of bucket: a refusal is to cost little beside its clock. */
-[[gnu::always_inline]] inline bool useTokens(uint64_t &word, const Gathering &gathering,
-                                             uint64_t tokens, uint64_t *left) {
-  const int64_t now = timeOf(gathering);
+/* The whole rule, for buckets that may have enough. */
+[[gnu::noinline]] bool takeTokens(uint64_t &word, const Gathering &gathering, int64_t now,
+                                  uint64_t tokens, uint64_t *left) {
   const std::atomic_ref<uint64_t> state(word);
   uint64_t seen = state.load(std::memory_order_relaxed);
   for (;;) {
@@ -87,6 +87,19 @@ uint64_t tokensSince(int64_t moment, const Gathering &gathering, int64_t now) {
       return true;
     }
   }
+}
+
+/* In line for either kind of bucket, and straight on where the bucket is dry, as nearly every event of
+ * a flood finds it: one look at the clock, one comparison. */
+[[gnu::always_inline]] inline bool useTokens(uint64_t &word, const Gathering &gathering,
+                                             uint64_t tokens, uint64_t *left) {
+  const int64_t now = timeOf(gathering);
+  const auto moment = static_cast<int64_t>(std::atomic_ref(word).load(std::memory_order_relaxed));
+  if (moment <= now - gathering.interval || tokens == 0) [[unlikely]] {
+    return takeTokens(word, gathering, now, tokens, left);
+  }
+  *left = 0;
+  return false;
 }
 
 uint64_t timeToToken(uint64_t &word, const Gathering &gathering) {

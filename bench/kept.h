@@ -60,6 +60,16 @@ class OneExchange {
   std::atomic<uint32_t> taken_{0};
 };
 
+/* The same as modules reach a platform's lock: by two calls. */
+class OneExchangeCalled {
+ public:
+  __attribute__((noinline)) void lock() { lock_.lock(); }
+  __attribute__((noinline)) void unlock() { lock_.unlock(); }
+
+ private:
+  OneExchange lock_;
+};
+
 class PthreadSpinlock {
  public:
   PthreadSpinlock() { pthread_spin_init(&lock_, PTHREAD_PROCESS_PRIVATE); }

@@ -233,12 +233,23 @@ void lookUpName(benchmark::State &state) {
 
 /* ---- The least, and the lock ----------------------------------------------------------------- */
 
-const std::string COPY = limit("copy"), LOCKED_COPY = limit("copy, one exchange, one store");
+const std::string COPY = limit("copy"), LOCKED_COPY = limit("copy, one exchange, one store"),
+                  CALLED_COPY = limit("copy, one exchange, one store, called");
 
 void exchange(benchmark::State &state) {
   std::atomic<uint32_t> word{0};
   for (auto _ : state) benchmark::DoNotOptimize(word.exchange(1, std::memory_order_acquire));
 }
+
+/* A module's function is called, and it calls the platform's two. */
+class BehindCalls {
+ public:
+  using Visit = NoVisit;
+  __attribute__((noinline)) void read(Locators &into) { kept_.read(into); }
+
+ private:
+  Behind<OneExchangeCalled> kept_;
+};
 
 template <typename Kept>
 void measureLimit(const std::string &who) {
@@ -247,14 +258,6 @@ void measureLimit(const std::string &who) {
   measure({ONE + ALONE.name, who}, [=](auto &state) { readOne(state, *kept); })
       ->UseManualTime()
       ->Iterations(SINGLE_READINGS);
-}
-
-/* Called as the host's functions are, without what those check and note. */
-__attribute__((noinline)) void bareLock(OneExchange &lock) {
-  lock.lock();
-}
-__attribute__((noinline)) void bareUnlock(OneExchange &lock) {
-  lock.unlock();
 }
 
 void measureLock(const std::shared_ptr<Ours> &ours) {
@@ -267,10 +270,10 @@ void measureLock(const std::shared_ptr<Ours> &ours) {
     }
   });
   measure({work, bare}, [](auto &state) {
-    OneExchange lock;
+    OneExchangeCalled lock; /* called as the host's are, without what those check and note */
     for (auto _ : state) {
-      bareLock(lock);
-      bareUnlock(lock);
+      lock.lock();
+      lock.unlock();
     }
   });
   ask(work, 1.5, {bare});
@@ -294,11 +297,13 @@ void measureReadOut(Cluster &cluster) {
   measureLimit<Behind<NoLock>>(COPY);
   measure({READ + ALONE.name, limit("one exchange")}, exchange);
   measureLimit<Behind<OneExchange>>(LOCKED_COPY);
+  measureLimit<BehindCalls>(CALLED_COPY);
   measureLock(make());
 
   for (const Pace &pace : {ALONE, TEN_KILOHERTZ}) {
     const std::string work = READ + pace.name;
     ask({work, {work}, 1.5, {{READ + ALONE.name, LOCKED_COPY}}});
+    ask({work, {work}, 1.2, {{READ + ALONE.name, CALLED_COPY}}});
     ask(work, 0.6, {SHARED_MUTEX});
     ask(work, 1.0, {URCU_MEMB});
   }

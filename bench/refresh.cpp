@@ -6,7 +6,9 @@
 #include <memory>
 #include <mutex>
 
+#include "bench/kept.h"
 #include "bench/subjects.h"
+#include "karst_resolver/trace.h"
 
 namespace bench {
 namespace {
@@ -121,32 +123,59 @@ class Stores {
 /* What a refresh must do whatever surrounds it: the locks are taken four times, the cache's for the copy
  * and for the walk, the instance's for the copy and for the call, and one reference taken and given back.
  * Six exchanges that nothing contends for, and the bytes. */
+template <typename Lock>
 class LockedStores {
  public:
   static inline const std::string NAME = limit("stores, six locked exchanges");
   explicit LockedStores(size_t observers) : kept_(observers) {}
   void tell(const KARSTResolverNodeLocators &locators) {
+    for (Kept &kept : kept_) tell(kept, locators);
+  }
+
+ protected:
+  struct Kept {
+    std::atomic<uint64_t> references{1};
+    Lock lock;
+    KARSTResolverNodeLocators locators;
+  };
+
+  void tell(Kept &kept, const KARSTResolverNodeLocators &locators) {
+    kept.references.fetch_add(1, std::memory_order_relaxed);
+    kept.locators = locators;
+    for (Lock *lock : {&cache_, &kept.lock, &kept.lock, &cache_}) {
+      lock->lock();
+      benchmark::DoNotOptimize(&kept);
+      lock->unlock();
+    }
+    kept.references.fetch_sub(1, std::memory_order_relaxed);
+  }
+
+  Lock cache_;
+  std::vector<Kept> kept_;
+};
+
+/* The same with the calls that a module cannot do without: of the locks, of its client, and of the
+ * three trace statements that ask whether their class is on. */
+class CalledStores : LockedStores<OneExchangeCalled> {
+ public:
+  static inline const std::string NAME = limit("stores, six locked exchanges, called");
+  using LockedStores::LockedStores;
+  void tell(const KARSTResolverNodeLocators &locators) {
     for (Kept &kept : kept_) {
-      kept.references.fetch_add(1, std::memory_order_relaxed);
-      kept.locators = locators;
-      for (std::atomic<uint32_t> *lock : {&cache_, &kept.lock, &kept.lock, &cache_}) {
-        uint32_t nobody = 0;
-        benchmark::DoNotOptimize(lock->compare_exchange_strong(nobody, 1));
-        benchmark::DoNotOptimize(&kept);
-        lock->store(0, std::memory_order_release);
+      LockedStores::tell(kept, locators);
+      client_(&calls_);
+      for (int statement = 0; statement < 3; statement++) {
+        benchmark::DoNotOptimize(Trace_ClassLevelGet(KARST_RESOLVER_TRACE_CLASS_InvokeCallback));
       }
-      kept.references.fetch_sub(1, std::memory_order_relaxed);
     }
   }
 
  private:
-  struct Kept {
-    std::atomic<uint64_t> references{1};
-    std::atomic<uint32_t> lock{0};
-    KARSTResolverNodeLocators locators;
-  };
-  std::atomic<uint32_t> cache_{0};
-  std::vector<Kept> kept_;
+  static void count(std::atomic<uint64_t> *calls) {
+    calls->store(calls->load(std::memory_order_relaxed) + 1, std::memory_order_relaxed);
+  }
+  std::atomic<uint64_t> calls_{0};
+  void (*volatile client_)(std::atomic<uint64_t> *calls) = count;
 };
 
 template <typename Peer>
@@ -176,11 +205,14 @@ void measureRefresh(Cluster &cluster) {
     measureTelling<Signal>(work, instances);
     measureTelling<Functions>(work, instances);
     measureTelling<Stores>(work, instances);
-    measureTelling<LockedStores>(work, instances);
+    measureTelling<LockedStores<OneExchange>>(work, instances);
+    measureTelling<CalledStores>(work, instances);
     number++;
   }
   for (const size_t instances : {128, 10'000}) {
-    ask("refresh an instance of " + std::to_string(instances), 0.4, {Signal::NAME});
+    const std::string work = "refresh an instance of " + std::to_string(instances);
+    ask(work, 0.4, {Signal::NAME});
+    ask(work, 1.2, {CalledStores::NAME});
   }
   ask({"one of 100000 refreshed, against one of 128",
        {"refresh an instance of 100000"},

@@ -1,24 +1,20 @@
-/* What feeds the directory: the cluster file with its rules and its reloads, and this machine's own
- * interfaces.
+/* What feeds the directory: what a cluster file becomes (what is refused: transcripts/refusals.txt),
+ * what the directory is told of it, and this machine's own interfaces.
  */
 #include <arpa/inet.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <condition_variable>
-#include <deque>
 #include <filesystem>
 #include <fstream>
-#include <mutex>
-#include <optional>
 #include <regex>
 
 #include "host/directory/records.h"
-#include "host/kernel/text.h"
 #include "host/sources/cluster_file_source.h"
 #include "host/sources/machine_uuid.h"
 #include "host/sources/own_interfaces_source.h"
+#include "host/sources/published_entries.h"
 #include "tests/log_lines.h"
 
 namespace {
@@ -27,258 +23,115 @@ using host::Entry;
 using host::toString;
 using namespace testing;
 
-/* ---- Shorthand: UUIDs that end in two digits of choice --------------------------------------- */
+/* UUIDs that end in two digits of choice; in a file, @a1 stands for the one that ends in a1. */
+const std::string begin = "00000000-0000-4000-8000-0000000000";
 
-/* @a1 stands for the UUID that ends in a1, in quotation marks, #a1 for the same without. */
+zel_UUID uuid(const std::string &end) {
+  return host::parseUUID(begin + end).value();
+}
 std::string expand(const std::string &text) {
-  static const std::regex quoted("@([a-c]\\d)");
-  static const std::regex plain("#([a-c]\\d)");
-  return std::regex_replace(std::regex_replace(text, quoted, "\"#$1\""), plain,
-                            "00000000-0000-4000-8000-0000000000$1");
+  return std::regex_replace(text, std::regex("@([a-c]\\d)"), "\"" + begin + "$1\"");
 }
-zel_UUID uuid(const char *end) {
-  return host::parseUUID(expand(std::string("#") + end)).value();
+Entry node(const char *end, const KarstNodeEntry &record) {
+  return {KARST_TYPE_NODE, uuid(end), uuid(end), host::encode(record)};
 }
-host::ClusterContent parse(const std::string &text) {
-  return host::parseClusterText(expand(text), "c.json");
+Entry health(const zel_UUID &netIf, const char *owner, uint32_t flags) {
+  KarstHealthStatusEntry record{};
+  record.healthFlags = flags;
+  return {KARST_TYPE_HEALTH_STATUS, netIf, uuid(owner), host::encode(record)};
 }
-
-/* An otherwise good file with these fields of a node, or of its interface, beside the UUID. */
-std::string node(const std::string &fields) {
-  return R"({"nodes":[{"uuid":@a1,)" + fields + "}]}";
+Entry interface(const zel_UUID &netIf, const char *owner, KarstNetInterfaceEntry record = {}) {
+  record.networkType = KARST_NETWORK_TYPE_IP;
+  return {KARST_TYPE_NET_INTERFACE, netIf, uuid(owner), host::encode(record)};
 }
-std::string interface(const std::string &fields) {
-  return node(R"("interfaces":[{"uuid":@b1,)" + fields + "}]");
-}
-std::string objects(const std::string &list) {
-  return R"({"self":@a9,"nodes":[{"uuid":@a1}],"objects":[)" + list + "]}";
+KarstIpAddress address(const std::string &text) {
+  KarstIpAddress result{};
+  result.isIPv6 = text.find(':') != std::string::npos;
+  EXPECT_EQ(inet_pton(result.isIPv6 ? AF_INET6 : AF_INET, text.c_str(), result.address), 1);
+  return result;
 }
 
-/* ---- Entries as text, with the last two digits of their UUIDs --------------------------------- */
-
-std::string endOf(const zel_UUID &uuid) {
-  return toString(uuid).substr(34);
-}
-std::string hexOf(const uint8_t *bytes, size_t size) {
-  std::string text;
-  for (size_t i = 0; i < size; i++) text += host::formatText("%02x", bytes[i]);
-  return text;
-}
-std::string textOf(const uint8_t *address, bool isIPv6) {
-  char text[INET6_ADDRSTRLEN];
-  return inet_ntop(isIPv6 ? AF_INET6 : AF_INET, address, text, sizeof text);
-}
-std::string textOf(const std::vector<KarstIpAddress> &addresses) {
-  std::string text;
-  for (const auto &one : addresses) text += " " + textOf(one.address, one.isIPv6);
-  return text;
-}
-
-std::string shown(const Entry &entry) {
-  const std::string whose = endOf(entry.uuid) + " of " + endOf(entry.owner) + ": ";
-  KarstNodeEntry node;
-  KarstHealthStatusEntry health;
-  KarstNetInterfaceEntry netIf;
-  if (entry.type == KARST_TYPE_NODE && host::decode(entry.data, &node) == ZEL_OK) {
-    return host::formatText("node %s%u.%u flags %u", whose.c_str(), node.majorVersionNum,
-                            node.minorVersionNum, node.flags);
-  }
-  if (entry.type == KARST_TYPE_HEALTH_STATUS && host::decode(entry.data, &health) == ZEL_OK) {
-    return "health " + whose + std::to_string(health.healthFlags);
-  }
-  if (entry.type != KARST_TYPE_NET_INTERFACE || host::decode(entry.data, &netIf) != ZEL_OK) {
-    return std::to_string(entry.type) + " " + whose + hexOf(entry.data.data(), entry.data.size());
-  }
-  const std::vector<KarstIpAddress> addresses(netIf.ipAddresses,
-                                              netIf.ipAddresses + netIf.numIpAddresses);
-  return host::formatText(
-      "interface %stype %u, %s,%s, ports %u %u, TTL %u, bandwidth %lu, MAC %s, groups %s %s, "
-      "traffic %lx",
-      whose.c_str(), netIf.networkType, textOf(netIf.ipv4Address, false).c_str(),
-      textOf(addresses).c_str(), netIf.agentGroupPort, netIf.masterGroupPort, netIf.multicastTTL,
-      netIf.bandwidth, hexOf(netIf.macAddress, 6).c_str(), textOf(netIf.agentV6Group, true).c_str(),
-      textOf(netIf.masterV6Group, true).c_str(), netIf.trafficTypeMask);
-}
-std::vector<std::string> shown(const std::vector<Entry> &entries) {
-  std::vector<std::string> texts;
-  for (const Entry &entry : entries) texts.push_back(shown(entry));
-  return texts;
-}
-
-/* ---- The cluster file: what is refused, where, and in which words ---------------------------- */
-
-/* What is refused, where, and how the reason begins. */
-struct Refusal {
-  std::string text, place, reason;
-};
-
-const std::string twice = R"({"type":9,"uuid":@c1,"owner":@a1},{"type":9,"uuid":@c1,"owner":@a9})";
-
-const Refusal refusals[] = {
-    {"", ":1:1", "no valid JSON: syntax error while parsing value - unexpected end of input; exp"},
-    {"{\n \"nodes\": [\n  {} {}\n ]\n}", ":3:6", "no valid JSON: syntax error while parsing array"},
-    {R"({"nodes":[],"nodes":[]})", ": top level", R"(field "nodes" is given twice; keep one)"},
-    {node(R"("interfaces":[],"uuid":@a3)"), ": /nodes/0", R"(field "uuid" is given twice; keep)"},
-    {node(R"("colour":"red")"), ": /nodes/0",
-     R"(unknown field "colour"; known here: interfaces, name, rawRecord, uuid, version, witness)"},
-    {R"({"nodes":[],"a: b\nc":1})", ": top level", R"(unknown field "a: b\nc"; known here: $sch)"},
-    {R"({"a\nb":[{"c":1,"c":2}],"nodes":[]})", ": /a\\nb/0",
-     R"(field "c" is given twice; keep one)"},
-    {R"({"nodes":")" + std::string(1000, 'x'), ":1:1011",
-     "no valid JSON: syntax error while parsing value - invalid string: missing closing quote; "
-     "last read: '\"" +
-         std::string(59, 'x') + "...'"},
-    {node(R"("rawRecord":"a0f")"), ": /nodes/0/rawRecord", "\"a0f\" is refused; expected: hex"},
-    {R"({"nodes":[{"uuid":"node-1"}]})", ": /nodes/0/uuid",
-     "\"node-1\" is refused; expected: A UUID: 32 hexadecimal digits, plain or as 8-4-4-4-12"},
-    {R"({"self":"00000000000000000000000000000000","nodes":[]})", ": /self",
-     "\"00000000000000000000000000000000\" is refused; expected: a UUID other than the all-zero"},
-    {R"({"nodes":[{"uuid":@a1,"interfaces":[{"uuid":@b1}]},
-                  {"uuid":@a2,"interfaces":[{"uuid":@b2},{"uuid":@b1}]}]})",
-     ": /nodes/1/interfaces/1/uuid", "interface #b1 is there already, at /nodes/0/interfaces/0;"},
-    {objects(twice), ": /objects/1/uuid", "an object of this type and UUID, #c1 is there"},
-    {objects(R"({"type":9,"uuid":@c1})"), ": /objects/0", "missing field \"owner\"; expected: The"},
-    {objects(R"({"type":9,"uuid":@c1,"owner":@a8})"), ": /objects/0/owner",
-     R"(node #a8 is not in this file; expected: the UUID of one of its nodes or its "self")"},
-    {objects(R"({"type":3,"uuid":@c1,"owner":@a1})"), ": /objects/0/type", "3 is refused"},
-};
-
-/* The same of an interface: its fields, and places in it. */
-const Refusal interfaceRefusals[] = {
-    {R"("addresses":["::1","::2","::3","::4","::5","::6","::7","::8"])", "/addresses",
-     "too many items (8); expected: The interface's addresses"},
-    {R"("addresses":["::1","192.0.2.300"])", "/addresses/1", R"("192.0.2.300" is no address; exp)"},
-    {R"("ipv4":"2001:db8::1")", "/ipv4", R"("2001:db8::1" is no IPv4 address; expected: such as)"},
-    {R"("masterV6Group":"224.2.3.4")", "/masterV6Group", R"("224.2.3.4" is no IPv6 address; exp)"},
-    {R"("networkType":2,"ipv4":"192.0.2.1")", "/ipv4", "only an interface of networkType 1 has"},
-    {R"("bandwidth":9223372036854775808)", "/bandwidth", "9223372036854775808 is refused"},
-    {R"("trafficTypes":[0,64])", "/trafficTypes/1", "64 is refused; expected: A type of traffic"},
-    {R"("healthFlags":2)", "/healthFlags", R"(only an interface with "healthy": false has these)"},
-    {R"("rawRecord":"a0","ipv4":"192.0.2.1")", "", R"(field "ipv4" beside "rawRecord", which)"},
-};
-
-void expectRefusal(const std::string &text, const std::string &placeAndReason) {
-  EXPECT_THAT([&] { parse(text); },
-              ThrowsMessage<host::ClusterFileError>(StartsWith(expand("c.json" + placeAndReason))))
-      << text;
-}
-
-TEST(ClusterFile, RefusalsNamePlaceAndRule) {
-  for (const auto &[text, place, reason] : refusals) expectRefusal(text, place + ": " + reason);
-  for (const auto &[fields, place, reason] : interfaceRefusals) {
-    expectRefusal(interface(fields), ": /nodes/0/interfaces/0" + place + ": " + reason);
-  }
-  EXPECT_THAT([] { host::parseClusterFile("/nonexistent/c.json"); },
-              ThrowsMessage<host::ClusterFileError>(
-                  "/nonexistent/c.json: cannot be opened: No such file or directory"));
-  EXPECT_THROW(host::parseClusterFile("/"), host::ClusterFileError);
-}
-
-/* ---- The cluster file: what a good one means ------------------------------------------------- */
+/* ---- The cluster file ------------------------------------------------------------------------ */
 
 TEST(ClusterFile, EveryFieldOfNodesInterfacesAndObjectsBecomesAnEntryOfItsOwner) {
-  const auto content = parse(R"({"$schema":"cluster.schema.json","self":@a9,"nodes":[
+  const auto content =
+      host::parseClusterText(expand(R"({"$schema":"cluster.schema.json","self":@a9,"nodes":[
       {"uuid":@a2,"name":"beta","version":{"major":7,"minor":4294967295},"witness":true,
        "interfaces":[{"uuid":@b1,
          "networkType":1, "addresses":["2001:db8::7","192.0.2.7"], "ipv4":"198.51.100.7",
-         "trafficTypes":[0,1,63], "mac":"02:00:5e:10:0a:FF", "bandwidth":9223372036854775807,
+         "trafficTypes":[0,1,63], "mac":"02:00:00:00:0a:FF", "bandwidth":9223372036854775807,
          "agentGroupPort":12345, "masterGroupPort":23451, "multicastTTL":5,
-         "agentV6Group":"ff02::2:3:4", "masterV6Group":"ff02::1:2:3"}]},
+         "agentV6Group":"ff02::2", "masterV6Group":"ff02::1"}]},
       {"uuid":@a3,"rawRecord":"00fF"},
       {"uuid":@a1,"interfaces":[{"uuid":@b3,"healthy":false}, {"uuid":@b2,"name":"eth0"},
         {"uuid":@b4,"healthy":null}, {"uuid":@b5,"healthy":false,"healthFlags":6}]}],
     "objects":[{"type":255,"uuid":@c1,"owner":@a9,"name":"volume"},
-               {"type":0,"uuid":@c1,"owner":@a1}]})");
+               {"type":0,"uuid":@c1,"owner":@a1}]})"),
+                             "c.json");
   EXPECT_EQ(content.self, uuid("a9"));
   EXPECT_THAT(content.names, ElementsAre(Pair(uuid("a2"), "beta"), Pair(uuid("b2"), "eth0"),
                                          Pair(uuid("c1"), "volume")));
-  const std::string plain =
-      "type 1, 0.0.0.0,, ports 0 0, TTL 0, bandwidth 0, MAC 000000000000, groups :: ::, traffic 0";
-  EXPECT_THAT(
-      shown(content.entries),
-      ElementsAre("0 c1 of a1: ", "node a1 of a1: 0.0 flags 0",
-                  "node a2 of a2: 7.4294967295 flags 2", "3 a3 of a3: 00ff",
-                  "interface b1 of a2: type 1, 198.51.100.7, 2001:db8::7 192.0.2.7, "
-                  "ports 12345 23451, TTL 5, bandwidth 9223372036854775807, MAC 02005e100aff, "
-                  "groups ff02::2:3:4 ff02::1:2:3, traffic 8000000000000003",
-                  "interface b2 of a1: " + plain, "interface b3 of a1: " + plain,
-                  "interface b4 of a1: " + plain, "interface b5 of a1: " + plain,
-                  "health b1 of a2: 0", "health b2 of a1: 0", "health b3 of a1: 1",
-                  "health b5 of a1: 6", "255 c1 of a9: "));
-}
-
-TEST(ClusterFile, TheExampleIsGoodAndNamesItsNodes) {
-  EXPECT_GE(host::parseClusterFile(CLUSTER_EXAMPLE).names.size(), 9u);
-}
-
-/* ---- Differences ----------------------------------------------------------------------------- */
-
-TEST(Difference, BuildsFromTheGroundUpAndTakesDownFromTheTop) {
-  const auto entry = [](uint8_t type, const char *end, uint8_t data = 0) {
-    return Entry{type, uuid(end), uuid("a1"), {data}};
+  const KarstNetInterfaceEntry whole{
+      .networkType = 1,
+      .ipv4Address = {198, 51, 100, 7},
+      .networkPart = {},
+      .agentGroupPort = 12345,
+      .masterGroupPort = 23451,
+      .multicastTTL = 5,
+      .bandwidth = INT64_MAX,
+      .macAddress = {2, 0, 0, 0, 0x0a, 0xff},
+      .agentV6Group = {0xff, 2, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 2},
+      .masterV6Group = {0xff, 2, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1},
+      .padding = {},
+      .numIpAddresses = 2,
+      .ipAddresses = {address("2001:db8::7"), address("192.0.2.7")},
+      .trafficTypeMask = 0x8000000000000003,
   };
-  const Entry low = entry(0, "c1"), node = entry(3, "a1"), interface = entry(6, "b1"),
-              health = entry(7, "b1"), high = entry(9, "c2");
-  const std::vector<Entry> cluster = {low, node, interface, health, high};
-  EXPECT_THAT(host::difference({}, cluster).changed,
-              ElementsAre(health, interface, node, low, high));
-  EXPECT_THAT(host::difference(cluster, {}).removed,
-              ElementsAre(low, high, node, interface, health));
-  const auto news = host::difference(cluster, {low, entry(3, "a1", 1), interface, health});
-  EXPECT_THAT(news.changed, ElementsAre(entry(3, "a1", 1)));
-  EXPECT_THAT(news.removed, ElementsAre(high));
+  const zel_UUID b1 = uuid("b1"), b2 = uuid("b2"), b3 = uuid("b3"), b4 = uuid("b4"),
+                 b5 = uuid("b5");
+  const std::vector<Entry> expected = {
+      {0, uuid("c1"), uuid("a1"), {}},
+      node("a1", {}),
+      node("a2", {7, UINT32_MAX, KARST_NODE_FLAG_WITNESS, 0, 0}),
+      {KARST_TYPE_NODE, uuid("a3"), uuid("a3"), {0x00, 0xff}},
+      interface(b1, "a2", whole),
+      interface(b2, "a1"),
+      interface(b3, "a1"),
+      interface(b4, "a1"),
+      interface(b5, "a1"),
+      health(b1, "a2", 0),
+      health(b2, "a1", 0),
+      health(b3, "a1", 1),
+      health(b5, "a1", 6),
+      {255, uuid("c1"), uuid("a9"), {}},
+  };
+  EXPECT_THAT(content.entries, ElementsAreArray(expected));
 }
 
-/* ---- Reloads --------------------------------------------------------------------------------- */
+/* How a watch reads it however it changes: transcripts/watch.txt. */
+TEST(ClusterFile, AChangeBetweenLoadAndWatchIsSeenAndARefusedFileChangesNothing) {
+  const std::string path = TempDir() + "cluster." + std::to_string(getpid());
+  const auto write = [&](const std::string &text) { std::ofstream(path) << expand(text); };
+  host::Directory directory;
+  host::ClusterFileSource source(path, directory);
+  write(R"({"nodes":[]})");
+  source.load();
+  write("{");
+  EXPECT_THROW(source.load(), host::ClusterFileError);
+  EXPECT_EQ(source.content().entries.size(), 0u);
+  write(R"({"nodes":[{"uuid":@a1}]})");
+  size_t changed = 0;
+  source.watch([&](const host::Reload &report) { changed += report.difference.changed.size(); });
+  EXPECT_EQ(changed, 1u);
+  EXPECT_THAT(directory.entries(KARST_TYPE_NODE), ElementsAre(node("a1", {})));
+  host::ClusterFileSource nowhere("/nonexistent/cluster.json", directory);
+  EXPECT_THROW(nowhere.watch({}), std::system_error);
+}
 
-/* A file in a folder of its own, its source, and what the source's watch reports. */
-class ClusterFileReload : public Test {
- protected:
-  ClusterFileReload() {
-    std::filesystem::create_directory(folder_);
-    source_.emplace(path(), directory_);
-  }
-  ~ClusterFileReload() override {
-    source_.reset();
-    std::filesystem::remove_all(folder_);
-  }
+/* ---- What the directory is told -------------------------------------------------------------- */
 
-  std::string path(const char *name = "cluster.json") const { return folder_ / name; }
-  void write(const std::string &text, const char *name = "cluster.json") const {
-    std::ofstream(path(name)) << expand(text);
-  }
-  /* Waits for the next report of the watch. */
-  host::Reload next() {
-    std::unique_lock lock(mutex_);
-    const bool told =
-        told_.wait_for(lock, std::chrono::minutes(1), [&] { return !reports_.empty(); });
-    if (!told) throw std::runtime_error("nothing was reported");
-    host::Reload report = reports_.front();
-    reports_.pop_front();
-    return report;
-  }
-  void watch() {
-    source_->watch([&](const host::Reload &report) {
-      const std::lock_guard lock(mutex_);
-      reports_.push_back(report);
-      told_.notify_all();
-    });
-  }
-  std::string heldHealth() const {
-    return shown(directory_.entries(KARST_TYPE_HEALTH_STATUS).at(0));
-  }
-
-  const LogLines log_;
-  const std::filesystem::path folder_{TempDir() + "cluster." + std::to_string(getpid())};
-  host::Directory directory_;
-  std::mutex mutex_;
-  std::condition_variable told_;
-  std::deque<host::Reload> reports_;
-  std::optional<host::ClusterFileSource> source_;
-  const std::string good_ = interface(R"("healthy":true)"), bad_ = interface(R"("healthy":false)");
-};
-
-TEST_F(ClusterFileReload, SubscribersHearOfTheDifferenceAlone) {
+TEST(PublishedEntries, AreBuiltFromTheGroundUpTakenDownFromTheTopAndOtherwiseLeftAlone) {
+  host::Directory directory({1, 16});
   std::string heard; /* by the one delivery thread; read while it is idle */
   KarstQuery query{};
   query.type = KARST_TYPE_NET_INTERFACE;
@@ -290,54 +143,25 @@ TEST_F(ClusterFileReload, SubscribersHearOfTheDifferenceAlone) {
         (status == ZEL_OK ? "+" : "-") + toString(header->uuid).substr(34);
     return ZEL_OK;
   };
-  const auto load = [&](const char *interfaces) {
-    write(node(std::string("\"interfaces\":[") + interfaces + "]"));
-    source_->load();
-    directory_.waitUntilIdle();
+  const auto entry = [](uint8_t type, const char *end, uint8_t data = 0) {
+    return Entry{type, uuid(end), uuid("a1"), {data}};
   };
-  ASSERT_EQ(directory_.subscribe(&query, listen, &heard), ZEL_OK);
-  directory_.put({KARST_TYPE_NET_INTERFACE, uuid("b9"), uuid("a9"), {}}); /* another source's */
-  load(R"({"uuid":@b1},{"uuid":@b2},{"uuid":@b3})");
-  load(R"({"uuid":@b4},{"uuid":@b2,"ipv4":"192.0.2.1"},{"uuid":@b1})");
-  EXPECT_EQ(heard, "+b9+b1+b2+b3-b3+b2+b4");
-  directory_.unsubscribe(&query, listen, &heard);
-  directory_.waitUntilIdle();
-}
-
-TEST_F(ClusterFileReload, AWatchedFileIsReadHoweverItChangesAndEachRefusalReportedOnce) {
-  write(good_);
-  source_->load();
-  write(bad_); /* between load and watch */
-  watch();
-  EXPECT_EQ(next().difference.changed.size(), 1u);
-  EXPECT_EQ(heldHealth(), "health b1 of a1: 1");
-
-  write(good_, "new");
-  std::filesystem::rename(path("new"), path());
-  EXPECT_EQ(next().difference.changed.size(), 1u);
-  write(bad_); /* the watch did not go with the file that was replaced */
-  EXPECT_EQ(next().difference.changed.size(), 1u);
-
-  write("{");
-  EXPECT_THAT(next().refusal, HasSubstr("cluster.json:1:2: no valid JSON"));
-  EXPECT_EQ(heldHealth(), "health b1 of a1: 1");
-  EXPECT_EQ(source_->content().entries.size(), 3u);
-  EXPECT_THROW(source_->load(), host::ClusterFileError);
-  write(bad_); /* as before the refusal: good again is news even so */
-  EXPECT_EQ(next().refusal, "");
-
-  std::filesystem::rename(path(), path("aside"));
-  EXPECT_THAT(next().refusal, HasSubstr("the file is gone"));
-  EXPECT_EQ(heldHealth(), "health b1 of a1: 1");
-  write(good_, "aside");
-  std::filesystem::rename(path("aside"), path());
-  EXPECT_EQ(next().difference.changed.size(), 1u);
-  EXPECT_EQ(heldHealth(), "health b1 of a1: 0");
-}
-
-TEST_F(ClusterFileReload, AFolderThatCannotBeWatchedIsAnError) {
-  std::filesystem::remove_all(folder_);
-  EXPECT_THROW(watch(), std::system_error);
+  const Entry low = entry(0, "c1"), node = entry(3, "a1"), first = entry(6, "b1"),
+              second = entry(6, "b2"), health = entry(7, "b1"), high = entry(9, "c2");
+  host::PublishedEntries published(directory);
+  ASSERT_EQ(directory.subscribe(&query, listen, &heard), ZEL_OK);
+  directory.put(entry(6, "b9")); /* another source's */
+  EXPECT_THAT(published.replace({low, node, first, second, health, high}).changed,
+              ElementsAre(health, first, second, node, low, high));
+  const auto news = published.replace({low, entry(3, "a1", 1), second, entry(6, "b3"), health});
+  EXPECT_THAT(news.changed, ElementsAre(entry(6, "b3"), entry(3, "a1", 1)));
+  EXPECT_THAT(news.removed, ElementsAre(high, first));
+  EXPECT_THAT(published.replace({}).removed,
+              ElementsAre(low, entry(3, "a1", 1), second, entry(6, "b3"), health));
+  directory.waitUntilIdle();
+  EXPECT_EQ(heard, "+b9+b1+b2-b1+b3-b2-b3");
+  directory.unsubscribe(&query, listen, &heard);
+  directory.waitUntilIdle();
 }
 
 /* ---- UUIDs that are not stored --------------------------------------------------------------- */
@@ -362,25 +186,24 @@ TEST(NamedUUID, FollowsFromOwnerAndNameAlone) { /* the standard's own example */
 /* ---- This machine's interfaces --------------------------------------------------------------- */
 
 host::OwnAddress own(const std::string &text, bool local = false, bool passing = false) {
-  host::OwnAddress result{{}, local, passing};
-  result.address.isIPv6 = text.find(':') != std::string::npos;
-  inet_pton(result.address.isIPv6 ? AF_INET6 : AF_INET, text.c_str(), result.address.address);
-  return result;
+  return {address(text), local, passing};
 }
 
 TEST(OwnInterfaces, SevenAddressesComeInAnOrderThatDoesNotDependOnTheSystem) {
   const LogLines log;
   host::OwnInterface eth0{"eth0", {}, false, true, {own("fe80::1", true)}};
-  for (const char *text : {"2001:db8::9", "192.0.2.1"}) { /* passing ones */
-    eth0.addresses.push_back(own(text, false, true));
-  }
-  for (const char *text :
-       {"2001:db8::1", "192.0.2.9", "192.0.2.4", "192.0.2.8", "192.0.2.7", "192.0.2.6"}) {
-    eth0.addresses.push_back(own(text));
-  }
+  const std::vector<std::string> lasting = {"192.0.2.4", "192.0.2.6", "192.0.2.7",
+                                            "192.0.2.8", "192.0.2.9", "2001:db8::1"};
+  for (const auto &text : lasting) eth0.addresses.push_back(own(text));
+  eth0.addresses.push_back(own("192.0.2.1", false, true));
+  eth0.addresses.push_back(own("2001:db8::9", false, true));
   for (int turn = 1; turn <= 2; turn++) {
-    EXPECT_EQ(textOf(host::publishedAddresses(eth0)),
-              " 192.0.2.4 192.0.2.6 192.0.2.7 192.0.2.8 192.0.2.9 2001:db8::1 192.0.2.1");
+    const auto published = host::publishedAddresses(eth0);
+    ASSERT_EQ(published.size(), 7u);
+    for (size_t i = 0; i < 7; i++) {
+      const KarstIpAddress expected = address(i < 6 ? lasting[i] : "192.0.2.1");
+      EXPECT_EQ(std::memcmp(&published[i], &expected, sizeof expected), 0) << i;
+    }
     std::reverse(eth0.addresses.begin(), eth0.addresses.end());
   }
   EXPECT_THAT(log.texts,
@@ -393,20 +216,24 @@ TEST(OwnInterfaces, ANodeIsPublishedWithItsInterfacesAndTheirCarriersAsHealth) {
       {"eth0", {2, 0, 0, 0, 0, 1}, false, true, {own("192.0.2.1")}},
       {"eth1", {2, 0, 0, 0, 0, 2}, false, false, {own("2001:db8::1")}},
       {"eth2", {2, 0, 0, 0, 0, 3}, false, true, {own("fe80::1", true)}}};
-  host::OwnNode node{.uuid = uuid("a1"), .majorVersion = 3, .witness = true};
-  const std::string eth0 = endOf(host::namedUUID(node.uuid, "eth0")) + " of a1: ";
-  const std::string eth1 = endOf(host::namedUUID(node.uuid, "eth1")) + " of a1: ";
-  const auto entries = host::entriesOf(node, interfaces);
+  host::OwnNode self{.uuid = uuid("a1"), .majorVersion = 3, .witness = true};
+  const zel_UUID eth0 = host::namedUUID(self.uuid, "eth0"),
+                 eth1 = host::namedUUID(self.uuid, "eth1");
+  KarstNetInterfaceEntry first{}, second{};
+  first.macAddress[0] = second.macAddress[0] = 2;
+  first.macAddress[5] = 1;
+  second.macAddress[5] = 2;
+  first.numIpAddresses = second.numIpAddresses = 1;
+  first.ipAddresses[0] = address("192.0.2.1");
+  second.ipAddresses[0] = address("2001:db8::1");
+  const auto entries = host::entriesOf(self, interfaces);
   EXPECT_TRUE(std::is_sorted(entries.begin(), entries.end(), host::comesBefore));
-  const std::string before = ", ports 0 0, TTL 0, bandwidth 0, MAC 02000000000";
-  const std::string behind = ", groups :: ::, traffic 0";
-  EXPECT_THAT(shown(entries),
-              UnorderedElementsAre(
-                  "node a1 of a1: 3.0 flags 2", "health " + eth0 + "0", "health " + eth1 + "1",
-                  "interface " + eth0 + "type 1, 0.0.0.0, 192.0.2.1" + before + "1" + behind,
-                  "interface " + eth1 + "type 1, 0.0.0.0, 2001:db8::1" + before + "2" + behind));
-  node.includeLoopback = true;
-  EXPECT_EQ(host::entriesOf(node, interfaces).size(), 7u);
+  EXPECT_THAT(entries,
+              UnorderedElementsAre(node("a1", {3, 0, KARST_NODE_FLAG_WITNESS, 0, 0}),
+                                   health(eth0, "a1", 0), health(eth1, "a1", 1),
+                                   interface(eth0, "a1", first), interface(eth1, "a1", second)));
+  self.includeLoopback = true;
+  EXPECT_EQ(host::entriesOf(self, interfaces).size(), 7u);
 }
 
 }  // namespace

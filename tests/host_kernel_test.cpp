@@ -1,6 +1,5 @@
-/* The host kernel's own services (UUIDs, text, heaps, log, panic, frames) and the kernel as a
- * whole, with the resolver and the example client module loaded into it.
- */
+/* The host kernel's own services: UUIDs, text, heaps, log, panic, frames, and what it is as a whole.
+ * With modules in it: transcripts/embed.txt. */
 #include "host/host_kernel.h"
 
 #include <gmock/gmock.h>
@@ -9,7 +8,6 @@
 
 #include <thread>
 
-#include "host/directory/records.h"
 #include "host/kernel/frames.h"
 #include "host/kernel/heap.h"
 #include "host/kernel/panic.h"
@@ -17,7 +15,6 @@
 #include "platform/qxt.h"
 #include "platform/tolm.h"
 #include "tests/log_lines.h"
-#include "tests/uuids.h"
 
 namespace {
 
@@ -41,7 +38,6 @@ struct TestHeap {
     return zel_HeapAllocWithRA(id, size, asker);
   }
   void free(void *block) { zel_HeapFree(id, block); }
-  uint32_t used() const { return host::heapState(id).used; }
 
   zel_HeapID id = ZEL_NO_HEAP;
 };
@@ -75,9 +71,8 @@ TEST(Text, CutsNamesAndZeroesTheRest) {
 /* ---- Heaps ----------------------------------------------------------------------------------- */
 
 TEST(Heap, HoldsExactlyWhatTheSizingFunctionSays) {
-  for (const uint32_t size : {0u, 1u, 16u, 17u, 392u}) {
+  for (const uint32_t size : {0u, 17u, 392u}) {
     const uint32_t space = tolmapi_HeapRequest2Size(size);
-    EXPECT_GT(space, size);
     TestHeap heap(10 * space);
     std::vector<void *> taken(10);
     for (void *&block : taken) {
@@ -85,14 +80,14 @@ TEST(Heap, HoldsExactlyWhatTheSizingFunctionSays) {
       ASSERT_NE(block, nullptr);
       EXPECT_EQ(reinterpret_cast<uintptr_t>(block) % 16, 0u);
     }
-    EXPECT_EQ(heap.used(), 10 * space);
+    EXPECT_EQ(host::heapState(heap.id).used, 10 * space);
     EXPECT_EQ(heap.allocate(0), nullptr) << "the heap is full";
     heap.free(taken[3]);
     EXPECT_EQ(heap.allocate(size + 16), nullptr) << "only " << size << " bytes are free";
     EXPECT_EQ(heap.allocate(0xffffffff), nullptr) << "sizes do not wrap around";
     taken[3] = heap.allocate(size);
     for (void *block : taken) heap.free(block);
-    EXPECT_EQ(heap.used(), 0u);
+    EXPECT_EQ(host::heapState(heap.id).used, 0u);
     EXPECT_EQ(host::heapState(heap.id).peak, 10 * space);
   }
   EXPECT_EQ(tolmapi_HeapRequest2Size(0xffffffff), 0xffffffff);
@@ -184,8 +179,8 @@ __attribute__((noinline)) void expectToKnowTheCaller() {
   EXPECT_EQ(tolmapi_GetReturnAddress(0), reinterpret_cast<uint64_t>(__builtin_return_address(0)));
 }
 
-/* The platform's constants are the contract's: any other value is refused, and no block comes. */
 TEST(Kernel, SaysWhatThisHostIsAndWhoCallsAndRefusesLookupsThatAreNotAsAgreed) {
+  { host::Kernel earlier; }
   host::KernelSettings settings;
   settings.maxAssociations = 4321;
   settings.witness = true;
@@ -194,48 +189,19 @@ TEST(Kernel, SaysWhatThisHostIsAndWhoCallsAndRefusesLookupsThatAreNotAsAgreed) {
   EXPECT_TRUE(TOLM_IsWitnessNode());
   expectToKnowTheCaller();
 
-  const KarstNodeEntry record{};
-  kernel.directory().put({KARST_TYPE_NODE, {{1}}, {{1}}, host::encode(record)});
+  kernel.directory().put({KARST_TYPE_NODE, {{1}}, {{1}}, {}});
   KarstQuery query{};
   query.type = KARST_TYPE_NODE;
   query.flags = KARST_QUERY_BY_TYPE | KARST_QUERY_ALL;
   KarstEntryHeader header{};
-  EXPECT_EQ(KARST_FindEntry(&query, 0, &header, 63), ZEL_BAD_PARAM);
-  ASSERT_EQ(KARST_FindEntry(&query, 0, &header, sizeof header), ZEL_OK);
-  EXPECT_EQ(KARST_FindEntry(&query, 2, &header, sizeof header), ZEL_BAD_PARAM);
   const ExprMshAllocator allocator{};
   KarstFullEntry *entry = nullptr;
+  EXPECT_EQ(KARST_FindEntry(&query, 0, &header, 63), ZEL_BAD_PARAM);
+  EXPECT_EQ(KARST_FindEntry(&query, 2, &header, sizeof header), ZEL_BAD_PARAM);
   EXPECT_EQ(KARST_FindFullEntryByQuery(&query, 1, &allocator, &entry), ZEL_BAD_PARAM);
+  ASSERT_EQ(KARST_FindEntry(&query, 0, &header, sizeof header), ZEL_OK);
   EXPECT_EQ(KARST_FindFullEntryByHeader(&header, 1, &allocator, 1, &entry), ZEL_BAD_PARAM);
   EXPECT_EQ(KARST_FindFullEntryByHeader(&header, 0, &allocator, 0, &entry), ZEL_BAD_PARAM);
-  EXPECT_EQ(entry, nullptr);
-}
-
-TEST(Kernel, RunsTheExampleClientAndFollowsChanges) {
-  const zel_UUID self = nodeUUID(1), link = netIfUUID(1);
-  KarstNetInterfaceEntry interface {};
-  interface.networkType = KARST_NETWORK_TYPE_IP;
-  interface.numIpAddresses = 1;
-  interface.ipAddresses[0].address[0] = 10;
-  LogLines log;
-  {
-    host::Kernel kernel;
-    host::Directory &directory = kernel.directory();
-    directory.setSelf(self);
-    directory.put({KARST_TYPE_NODE, self, self, host::encode(KarstNodeEntry{})});
-    directory.put({KARST_TYPE_NET_INTERFACE, link, self, host::encode(interface)});
-    directory.put({KARST_TYPE_HEALTH_STATUS, link, self, host::encode(KarstHealthStatusEntry{})});
-    directory.setUsable(true);
-    kernel.modules().load(TEST_RESOLVER);
-    kernel.settle();
-    kernel.modules().load(TEST_CLIENT, {"CLIENT_USE_LOCAL_LOCATOR=0"});
-    kernel.settle();
-    directory.remove(KARST_TYPE_HEALTH_STATUS, link);
-    kernel.settle();
-  }
-  EXPECT_EQ(log.texts.front(), "client: this host's node is resolved");
-  EXPECT_THAT(log.texts, testing::Contains("client: 1 locators, the first of type 1"));
-  EXPECT_EQ(log.texts.back(), "client: no locators: ZEL_NOT_FOUND");
 }
 
 TEST(KernelDeathTest, IsOneAtATimeAndNeededAndEndsFatallyWithThingsLeftBehind) {

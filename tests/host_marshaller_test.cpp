@@ -3,7 +3,6 @@
  */
 #include "host/directory/marshaller.h"
 
-#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <cstring>
@@ -13,7 +12,6 @@
 #include <vector>
 
 #include "host/directory/records.h"
-#include "tests/log_lines.h"
 
 namespace {
 
@@ -163,17 +161,6 @@ TEST(MarshallerRefusal, OfTablesThatAreNoneAndOfEightAddresses) {
   }
   EXPECT_EQ(host::marshal(host::netInterfaceRecordTable, &record, &out), EXPR_MSH_OUT_OF_RANGE);
   EXPECT_EQ(out, Bytes{0xa0}) << "nothing is left behind";
-}
-
-TEST(MarshallerRefusal, IsReportedWithTheRecordsName) {
-  const LogLines log;
-  const Bytes bytes = wire("a1 'flags' 40");
-  KarstNodeEntry record{};
-  ExprMsh_UmshSingleStructure(nullptr, host::nodeRecordTable, bytes.data(), bytes.size(),
-                              "KarstNodeEntry", &record);
-  EXPECT_THAT(log.texts,
-              testing::ElementsAre(
-                  "A KarstNodeEntry record of 8 bytes is refused at byte 8: status 0xbad0203"));
 }
 
 }  // namespace

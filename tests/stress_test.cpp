@@ -20,7 +20,6 @@
 #include <cstdlib>
 #include <cstring>
 #include <deque>
-#include <map>
 #include <random>
 #include <thread>
 #include <vector>
@@ -45,15 +44,11 @@ uint32_t setting(const char *name, uint32_t otherwise) {
 }
 
 /* What is counted, so that a storm in which little happened fails. */
-enum Kind { Changed, Disturbed, Created, Refused, Called, Resolved, Unresolved, Kinds };
-const char *const kindNames[] = {"changes",
-                                 "disturbances",
-                                 "instances",
-                                 "creations refused",
-                                 "callbacks",
-                                 "answers",
-                                 "answers that there is none"};
-std::array<std::atomic<uint64_t>, Kinds> counts{};
+struct Count {
+  const char *what;
+  std::atomic<uint64_t> times{0};
+} changed{"changes"}, disturbed{"disturbances"}, created{"instances"}, refused{"creations refused"},
+    called{"callbacks"}, resolved{"answers"}, unresolved{"answers that there is none"};
 
 /* ---- Events ---------------------------------------------------------------------------------- */
 
@@ -104,7 +99,7 @@ struct Source {
 
   void changeNode(uint32_t node, Random &random) {
     const uint32_t what = random() % 12, netIf = node * NETIFS + random() % NETIFS;
-    counts[Changed]++;
+    changed.times++;
     if (what == 0) return directory.remove(KARST_TYPE_NODE, nodeUUID(node));
     if (what == 1) return directory.remove(KARST_TYPE_NET_INTERFACE, netIfUUID(netIf));
     if (what == 2) return directory.remove(KARST_TYPE_HEALTH_STATUS, netIfUUID(netIf));
@@ -115,7 +110,7 @@ struct Source {
   /* What concerns everybody. */
   void disturb(Random &random) {
     const uint32_t what = random() % 16, object = random() % OBJECTS;
-    counts[Disturbed]++;
+    disturbed.times++;
     if (what == 0) return directory.remove(objectType, objectUUID(object));
     if (what == 1) return directory.resync();
     if (what <= 5) return directory.setUsable(what != 2);
@@ -135,24 +130,20 @@ struct Resolver {
 #undef RESOLVER
 };
 
-/* The answers of one instance as one thread reads them. */
-struct Reader {
-  uint32_t version = 0;
-
-  void read(const Resolver &resolver, KARSTResolverInstance *instance) {
-    KARSTResolverNodeLocators set;
-    std::memset(&set, 0xee, sizeof set);
-    set.capacity = KARST_RESOLVER_MAX_LOCATORS;
-    const bool resolved = resolver.read(instance, &set) == ZEL_OK;
-    counts[resolved ? Resolved : Unresolved]++;
-    if (!resolved) return;
-    /* This host itself is reached also while its entry, and so its version, is not known: 0.0. */
-    if (set.nodeUUID == nodeUUID(0) && set.majorVersion == 0 && set.minorVersion == 0) return;
-    EXPECT_EQ(set.minorVersion, ~set.majorVersion) << "versions of two moments";
-    EXPECT_GE(set.majorVersion, version) << "versions went backwards";
-    version = set.majorVersion;
-  }
-};
+/* Reads an answer; `last` is the version that this thread has read of the instance before. */
+void read(const Resolver &resolver, KARSTResolverInstance *instance, uint32_t &last) {
+  KARSTResolverNodeLocators set;
+  std::memset(&set, 0xee, sizeof set);
+  set.capacity = KARST_RESOLVER_MAX_LOCATORS;
+  const bool found = resolver.read(instance, &set) == ZEL_OK;
+  (found ? resolved : unresolved).times++;
+  /* This host itself is reached also while its entry, and so its version, is not known: 0.0. */
+  const bool unknown = set.majorVersion == 0 && set.minorVersion == 0;
+  if (!found || (set.nodeUUID == nodeUUID(0) && unknown)) return;
+  EXPECT_EQ(set.minorVersion, ~set.majorVersion) << "versions of two moments";
+  EXPECT_GE(set.majorVersion, last) << "versions went backwards";
+  last = set.majorVersion;
+}
 
 /* Somebody who is called. Kept until the round is over, so that a late call finds it. */
 struct Watcher {
@@ -161,6 +152,7 @@ struct Watcher {
   const uint32_t slowness; /* turns that a call makes; it must not sleep */
   std::atomic<bool> ended{false}, running{false};
   std::atomic<uint32_t> state{KARST_RESOLVER_STATE_INIT};
+  KARSTResolverInstance *instance = nullptr; /* of one that is called for a whole round */
 
   static void told(void *data, KARSTResolverInstance *, uint32_t state) {
     auto *watcher = static_cast<Watcher *>(data);
@@ -169,7 +161,7 @@ struct Watcher {
     for (std::atomic<uint32_t> turn = 0; turn < watcher->slowness;) turn++;
     watcher->state = state;
     watcher->running = false;
-    counts[Called]++;
+    called.times++;
   }
 };
 
@@ -181,20 +173,20 @@ void callOnce(const Resolver &resolver, Random &random, std::deque<Watcher> &wat
   const zel_Status status =
       resolver.create(&instance, objectType, object ? objectUUID(random() % OBJECTS) : noUUID,
                       object && random() % 2 == 0 ? noUUID : nodeUUID(node), random() % 4 == 0);
-  counts[status == ZEL_OK ? Created : Refused]++;
+  (status == ZEL_OK ? created : refused).times++;
   ASSERT_EQ(instance != nullptr, status == ZEL_OK);
   if (instance == nullptr) return;
   Watcher &first = watchers.emplace_back(random() % 8 == 0 ? 5000 : 0);
   Watcher &second = watchers.emplace_back();
-  Reader reader;
+  uint32_t version = 0;
   for (Watcher *watcher : {&first, &second}) {
-    reader.read(resolver, instance);
+    read(resolver, instance, version);
     resolver.setCallback(instance, Watcher::told, watcher);
     EXPECT_NE(watcher->state, KARST_RESOLVER_STATE_INIT) << "called before SetCallback returned";
   }
   first.ended = true; /* replaced */
   if (random() % 4 == 0) resolver.setCallback(instance, nullptr, nullptr);
-  reader.read(resolver, instance);
+  read(resolver, instance, version);
   resolver.destroy(instance);
   second.ended = true;
 }
@@ -203,13 +195,6 @@ void callOnce(const Resolver &resolver, Random &random, std::deque<Watcher> &wat
 
 class Stress : public ::testing::Test {
  protected:
-  /* An instance that lives for a round and is read by everybody. */
-  struct Kept {
-    explicit Kept(uint32_t node) : watcher(node % 8 == 0 ? 5000 : 0) {}
-    Watcher watcher;
-    KARSTResolverInstance *instance = nullptr;
-  };
-
   Stress() { directory().setSelf(nodeUUID(0)); }
   ~Stress() override { destroyKept(); }
 
@@ -224,20 +209,20 @@ class Stress : public ::testing::Test {
 
   void keepInstances() {
     for (uint32_t node = 0; node < NODES; node++) {
-      Kept &one = kept.emplace_back(node);
+      Watcher &one = kept.emplace_back(node % 8 == 0 ? 5000 : 0);
       ASSERT_EQ(
           resolver.create(&one.instance, objectType, node < OBJECTS ? objectUUID(node) : noUUID,
                           nodeUUID(node), node == 0),
           ZEL_OK)
           << "node " << node;
-      resolver.setCallback(one.instance, Watcher::told, &one.watcher);
+      resolver.setCallback(one.instance, Watcher::told, &one);
     }
   }
 
   void destroyKept() {
-    for (Kept &one : kept) {
+    for (Watcher &one : kept) {
       if (one.instance != nullptr) resolver.destroy(one.instance);
-      one.watcher.ended = true;
+      one.ended = true;
     }
     kernel.settle(); /* the last calls still find the watchers */
     kept.clear();
@@ -255,10 +240,10 @@ class Stress : public ::testing::Test {
         source.changeNode(random() % (NODES / threads) * threads + thread, random);
       });
       start([this, thread](Random &random) { callOnce(resolver, random, watchers[thread]); });
-      start([this, readers = std::map<KARSTResolverInstance *, Reader>()](Random &random) mutable {
+      start([this, versions = std::array<uint32_t, NODES>()](Random &random) mutable {
         for (uint32_t i = 0; i < 4; i++) {
-          KARSTResolverInstance *instance = kept[random() % kept.size()].instance;
-          readers[instance].read(resolver, instance);
+          const uint32_t one = random() % NODES;
+          read(resolver, kept[one].instance, versions[one]);
         }
       });
     }
@@ -280,10 +265,11 @@ class Stress : public ::testing::Test {
 
   void expectDirectorysAnswer() {
     std::vector<HeldInstance> held;
-    for (const Kept &one : kept) held.push_back({one.instance, one.watcher.state});
+    for (const Watcher &one : kept) held.push_back({one.instance, one.state});
     const auto *cache = *static_cast<KARSTResolverCache **>(module.anySymbol("karstResolverCache"));
     EXPECT_THAT(differencesOf(cache, viewOf(directory(), nodeUUID(0), false, held)), IsEmpty());
-    for (const Kept &one : kept) Reader{}.read(resolver, one.instance);
+    uint32_t version = 0;
+    for (const Watcher &one : kept) read(resolver, one.instance, version = 0);
   }
 
   void playRound() {
@@ -304,7 +290,7 @@ class Stress : public ::testing::Test {
   host::Module &module = kernel.modules().load(KARST_RESOLVER_SO);
   const Resolver resolver{module};
   Source source{kernel.directory()};
-  std::deque<Kept> kept;
+  std::deque<Watcher> kept; /* one of each node, read by everybody */
   std::vector<std::deque<Watcher>> watchers{threads};
 };
 
@@ -323,9 +309,10 @@ TEST_F(Stress, EveryRoundEndsInTheDirectorysAnswer) {
 
   std::printf("%u rounds, %lu overflows\n", rounds, overflows);
   EXPECT_GE(overflows, rounds);
-  for (int kind = 0; kind < Kinds; kind++) {
-    std::printf("%10lu  %s\n", counts[kind].load(), kindNames[kind]);
-    EXPECT_GE(counts[kind], uint64_t{rounds} * operations / 100) << kindNames[kind];
+  for (const Count *count :
+       {&changed, &disturbed, &created, &refused, &called, &resolved, &unresolved}) {
+    std::printf("%10lu  %s\n", count->times.load(), count->what);
+    EXPECT_GE(count->times, uint64_t{rounds} * operations / 100) << count->what;
   }
 }
 
@@ -339,7 +326,7 @@ TEST(Loads, AThousandLeaveNothingBehind) {
   Source source{kernel.directory()};
   source.putEverything();
   Random random(1);
-  const uint64_t before = counts[Created];
+  const uint64_t before = created.times;
   for (uint32_t round = 0; round < 1000; round++) {
     const bool used = round % 20 == 0, amidEvents = round % 40 == 0;
     std::deque<Watcher> watchers;
@@ -362,7 +349,7 @@ TEST(Loads, AThousandLeaveNothingBehind) {
     ASSERT_THAT(kernel.alive(), IsEmpty());
     ASSERT_THAT(host::heapsAlive(), IsEmpty());
   }
-  EXPECT_GT(counts[Created] - before, 50u);
+  EXPECT_GT(created.times - before, 50u);
 }
 
 }  // namespace

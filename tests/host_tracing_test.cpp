@@ -199,6 +199,7 @@ const struct {
       {0, 0, 2, -1 - 1}, /* refused: the token left stays */
       {0, 0, 1, 0},
       {0, kSecond / 4, 1, -1},
+      {0, kSecond / 4, 0, 0}, /* none can always be had */
       {kSecond / 4 - 1, 1, 1, -1},
       {kSecond / 8 * 3, 0, 1, 0}, /* one and a half; the half is kept */
       {kSecond / 8 * 3, kSecond / 8, 1, -1},

@@ -12,6 +12,7 @@
 #include "tests/module_fixture.h"
 
 using sim::Call;
+using ::testing::ElementsAre;
 using ::testing::IsEmpty;
 
 namespace {
@@ -299,7 +300,7 @@ void Trial::recover() {
     held.push_back({client->instance, {}});
     if (!client->states.empty()) held.back().told = client->states.back();
   }
-  EXPECT_THAT(differencesOf(cache(), viewOf(directory(), nodeUUID(1), false, held)), IsEmpty());
+  EXPECT_THAT(differencesOf(cache(), directory(), held), IsEmpty());
 }
 
 void Trial::leave() {
@@ -405,5 +406,33 @@ INSTANTIATE_TEST_SUITE_P(Each, Faults,
                          ::testing::Combine(::testing::ValuesIn(Trial::procedures()),
                                             ::testing::Values(0, 1, 2)),
                          nameOf);
+
+/* ---- The directory's picture itself ---------------------------------------------------------- */
+
+TEST_F(ModuleTest, DiffersFromTheDirectoryInWhatIsStillDue) {
+  for (uint32_t number = 1; number <= 4; number++) putSimpleNode(number);
+  putObject(1, 2);
+  start();
+  Client client;
+  ASSERT_EQ(createForObject(client, 1), ZEL_OK);
+  setCallback(client);
+  const auto differences = [&] {
+    return differencesOf(cache(), directory(), {{client.instance, client.states.back()}});
+  };
+  EXPECT_THAT(differences(), IsEmpty());
+  putHealth(2, 1);
+  putNode(3, 9);
+  directory().remove(KARST_TYPE_NET_INTERFACE, netIfUUID(4));
+  putNode(5);
+  const auto of = [](const zel_UUID &uuid) { return ::testing::HasSubstr(host::toString(uuid)); };
+  EXPECT_THAT(differences(),
+              ElementsAre(of(netIfUUID(2)), of(nodeUUID(2)), of(nodeUUID(3)), of(nodeUUID(4)),
+                          of(nodeUUID(5)), of(objectUUID(1)), of(netIfUUID(4))));
+  sim.run();
+  EXPECT_THAT(differences(), IsEmpty());
+  client.states.back() = KARST_RESOLVER_STATE_RESOLVED;
+  EXPECT_THAT(differences(), ElementsAre(of(objectUUID(1)))) << "it was told otherwise";
+  destroy(client);
+}
 
 }  // namespace

@@ -472,16 +472,13 @@ void Cluster::requireEnabled() {
 
 /* The module holds what the directory says, where that fits. */
 std::vector<std::string> Cluster::differences() {
-  /* What is written to a free slot stays there, so one in eight is looked into, other ones after
-   * another course. Where every access is watched, all are. */
-  SlotSample sample;
-  if (!sim::access::watching) sample = {.step = 8, .first = simulation_.traceHash() % 8};
-  const auto fits = [](const auto &nodes, const auto &netIfs) {
-    return nodes.size() <= 64 && netIfs.size() <= 400;
-  };
+  const auto fits = [](size_t nodes, size_t netIfs) { return nodes <= 64 && netIfs <= 400; };
   const model::Resolver &resolver = lockstep_.resolver();
-  if (!usable_ || !resolver.enabled || !fits(resolver.nodes, resolver.netIfs))
-    return damageOf(lockstep_.cache(), sample);
+  const host::Directory &directory = simulation_.directory();
+  if (!usable_ || !resolver.enabled || !fits(resolver.nodes.size(), resolver.netIfs.size()) ||
+      !fits(directory.entries(KARST_TYPE_NODE).size(),
+            directory.entries(KARST_TYPE_NET_INTERFACE).size()))
+    return {};
   std::vector<HeldInstance> held;
   for (const Client *client : slots_) {
     if (!client) continue;
@@ -489,10 +486,7 @@ std::vector<std::string> Cluster::differences() {
     if (client->hasCallback) one.told = client->model->answers[client->lastTold].state;
     held.push_back(one);
   }
-  const DirectoryView view =
-      viewOf(simulation_.directory(), nodeUUID(1), simulation_.settings().witness, held);
-  return fits(view.nodes, view.netIfs) ? differencesOf(lockstep_.cache(), view, sample)
-                                       : damageOf(lockstep_.cache(), sample);
+  return differencesOf(lockstep_.cache(), directory, held, simulation_.settings().witness);
 }
 
 void Cluster::requireDirectoryTaken() {

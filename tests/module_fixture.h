@@ -1,13 +1,11 @@
-/* One fixture for the module's promises: a whole module in the simulator, driven step by step. */
+/* A whole module in the simulator, driven step by step: what the tests of its promises share. */
 #pragma once
 
+#include <arpa/inet.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <array>
-#include <initializer_list>
-#include <memory>
-#include <optional>
+#include <regex>
 #include <string>
 #include <vector>
 
@@ -18,91 +16,173 @@
 #include "sim/simulation.h"
 #include "tests/uuids.h"
 
-/* The addresses of locators: "10.0.0.1", "fd00::1". */
-std::vector<std::string> textsOf(const KARSTResolverNodeLocators &set);
-
 /* A client: an instance and what its callback was told. */
 struct Client {
   KARSTResolverInstance *instance = nullptr;
   std::vector<uint32_t> states; /* one a callback */
-  std::vector<uint16_t> counts; /* locators of the instance at that moment */
 };
 
-class ModuleTest : public ::testing::Test {
- protected:
-  ModuleTest() : ModuleTest(defaults()) {}
-  explicit ModuleTest(const sim::Settings &settings);
-  ~ModuleTest() override;
+/* The addresses of locators: "10.0.0.1", "fd00::1". */
+inline std::vector<std::string> textsOf(const KARSTResolverNodeLocators &set) {
+  std::vector<std::string> texts;
+  for (uint16_t i = 0; i < set.count; i++) {
+    const bool isIPv6 = set.locators[i].networkType == KARST_RESOLVER_LOCATOR_IPV6;
+    char text[INET6_ADDRSTRLEN] = "";
+    EXPECT_TRUE(isIPv6 || set.locators[i].networkType == KARST_RESOLVER_LOCATOR_IPV4);
+    inet_ntop(isIPv6 ? AF_INET6 : AF_INET, set.locators[i].address, text, sizeof text);
+    texts.emplace_back(text);
+  }
+  return texts;
+}
 
-  static sim::Settings defaults(); /* two delivery threads, every trace class at level 2 */
+class Bench {
+ public:
+  explicit Bench(const sim::Settings &settings = defaults()) : sim(settings) {
+    host::setLogSink(
+        [this](const host::LogLine &line) {
+          const std::string &text = line.text;
+          if (text.starts_with("KARSTResolver: ")) {
+            log.push_back(std::to_string(line.urgency) + " " +
+                          std::regex_replace(text, std::regex(":[0-9]+: "), ":N: "));
+          } else if (text.starts_with("heap ") || text.starts_with("lock domain ")) {
+            leftBehind.push_back(text);
+          }
+        },
+        true);
+  }
+  virtual ~Bench() {
+    sim.clearFaults();
+    sim.releaseAll();
+    if (module != nullptr) unload();
+    host::setLogSink(nullptr, false);
+    EXPECT_THAT(leftBehind, ::testing::IsEmpty());
+  }
 
-  /* Loads the module (what() of the refusal, empty when it loaded) and unloads it. */
-  std::string load(const std::vector<std::string> &parameters = {});
-  void unload();
+  /* Two delivery threads, every trace class at level 2. */
+  static sim::Settings defaults() {
+    sim::Settings settings;
+    settings.tracing.classLevel = 2;
+    settings.tracing.throttling = false;
+    return settings;
+  }
+
+  /* Loads the module; what() of the refusal, empty when it loaded. */
+  std::string load(const std::vector<std::string> &parameters = {}) {
+    try {
+      module = &sim.load(KARST_RESOLVER_SO, parameters);
+    } catch (const host::ModuleError &error) {
+      return error.what();
+    }
+    create_ = internal<decltype(KARSTResolver_Create)>("KARSTResolver_Create");
+    destroy_ = internal<decltype(KARSTResolver_Destroy)>("KARSTResolver_Destroy");
+    setCallback_ = internal<decltype(KARSTResolver_SetCallback)>("KARSTResolver_SetCallback");
+    read_ = internal<decltype(KARSTResolver_GetNodeLocators)>("KARSTResolver_GetNodeLocators");
+    return "";
+  }
+
+  void unload() { sim.unload(*std::exchange(module, nullptr)); }
 
   /* Loaded, usable, self is node 1, everything taken in. */
-  void start();
+  void start() {
+    directory().setSelf(nodeUUID(1));
+    directory().setUsable(true);
+    ASSERT_EQ(load(), "");
+    sim.run();
+  }
 
   /* ---- The directory ------------------------------------------------------------------------- */
 
   host::Directory &directory() { return sim.directory(); }
-  void putNode(uint32_t node, uint32_t major = 7, uint32_t minor = 1, uint32_t flags = 0);
+
+  template <typename Record>
+  void put(uint8_t type, const zel_UUID &uuid, const zel_UUID &owner, const Record &record) {
+    directory().put({type, uuid, owner, host::encode(record)});
+  }
+  void putNode(uint32_t node, uint32_t major = 7, uint32_t minor = 1, uint32_t flags = 0) {
+    put(KARST_TYPE_NODE, nodeUUID(node), nodeUUID(node), KarstNodeEntry{major, minor, flags, 1, 2});
+  }
   void putNetIf(uint32_t netIf, uint32_t node, std::initializer_list<const char *> addresses,
-                uint64_t trafficTypeMask = 0);
-  void putNetIf(uint32_t netIf, uint32_t node, const KarstNetInterfaceEntry &record);
-  void putHealth(uint32_t netIf, uint32_t healthFlags, uint64_t timestamp = 1);
-  void putObject(uint32_t object, uint32_t node);
-  void putRaw(uint8_t type, const zel_UUID &uuid, const zel_UUID &owner,
-              std::vector<uint8_t> data = {0xff});
-  static KarstNetInterfaceEntry netIfRecord(std::initializer_list<const char *> addresses);
+                uint64_t trafficTypeMask = 0, uint32_t networkType = KARST_NETWORK_TYPE_IP) {
+    KarstNetInterfaceEntry record{};
+    record.networkType = networkType;
+    record.trafficTypeMask = trafficTypeMask;
+    for (const char *text : addresses) {
+      KarstIpAddress &address = record.ipAddresses[record.numIpAddresses++];
+      address.isIPv6 = std::string(text).find(':') != std::string::npos;
+      EXPECT_EQ(inet_pton(address.isIPv6 ? AF_INET6 : AF_INET, text, address.address), 1) << text;
+    }
+    put(KARST_TYPE_NET_INTERFACE, netIfUUID(netIf), nodeUUID(node), record);
+  }
+  void putHealth(uint32_t netIf, uint32_t healthFlags, uint64_t timestamp = 1) {
+    KarstHealthStatusEntry record{};
+    record.healthFlags = healthFlags;
+    record.timestamp = timestamp;
+    put(KARST_TYPE_HEALTH_STATUS, netIfUUID(netIf), noUUID, record);
+  }
+  void putObject(uint32_t object, uint32_t node, uint8_t data = 0xa0) {
+    directory().put({objectType, objectUUID(object), nodeUUID(node), {data}});
+  }
 
   /* A node with one healthy interface of the same number, at 10.0.0.<number>. */
-  void putSimpleNode(uint32_t number);
+  void putSimpleNode(uint32_t number) {
+    putNode(number);
+    putHealth(number, 0);
+    putNetIf(number, number, {("10.0.0." + std::to_string(number)).c_str()});
+  }
 
   /* ---- Clients ------------------------------------------------------------------------------- */
 
   zel_Status create(Client &client, const zel_UUID &object, const zel_UUID &node,
-                    bool useLocalLocator = false, uint32_t entryType = objectType);
-  zel_Status createForNode(Client &client, uint32_t node, bool useLocalLocator = false) {
-    return create(client, noUUID, nodeUUID(node), useLocalLocator);
+                    bool useLocalLocator = false) {
+    return sim.call("client", [&] {
+      return create_(&client.instance, objectType, object, node, useLocalLocator);
+    });
   }
-  zel_Status createForObject(Client &client, uint32_t object, uint32_t hintNode = 0) {
-    return create(client, objectUUID(object), hintNode == 0 ? noUUID : nodeUUID(hintNode));
+  void setCallback(Client &client, bool install = true) {
+    const KARSTResolverCallback told = [](void *data, KARSTResolverInstance *instance,
+                                          uint32_t state) {
+      auto *one = static_cast<Client *>(data);
+      EXPECT_EQ(instance, one->instance);
+      one->states.push_back(state);
+    };
+    sim.call("client", [&] { setCallback_(client.instance, install ? told : nullptr, &client); });
   }
-  void setCallback(Client &client);
-  void removeCallback(Client &client);
-  void destroy(Client &client);
-  zel_Status read(const Client &client, KARSTResolverNodeLocators *set);
+  void destroy(Client &client) {
+    sim.call("client", [&] { destroy_(std::exchange(client.instance, nullptr)); });
+  }
+  zel_Status read(const Client &client, KARSTResolverNodeLocators *set) {
+    return sim.call("client", [&] { return read_(client.instance, set); });
+  }
 
   /* ---- Inside -------------------------------------------------------------------------------- */
 
-  host::Module &module() { return *module_; }
-  KARSTResolverCache *cache();
-  KARSTResolverNode *cachedNode(uint32_t number); /* null: not cached */
-  std::vector<KARSTResolverNetIf *> cachedNetIfs();
-  template <typename Function>
-  Function *internal(const char *name) {
-    return reinterpret_cast<Function *>(module_->anySymbol(name));
+  /* By any name that the module's file has. */
+  template <typename Symbol>
+  Symbol *internal(const char *name) {
+    return reinterpret_cast<Symbol *>(module->anySymbol(name));
   }
+  KARSTResolverCache *cache() { return *internal<KARSTResolverCache *>("karstResolverCache"); }
 
   /* Events of the trace since the last call of this, in order. */
-  std::vector<host::TracedRecord> traced();
-
-  /* Those of the platform's calls, by name. */
-  std::vector<std::string> calls(const std::vector<std::string> &which);
+  std::vector<host::TracedRecord> traced() {
+    std::vector<host::TracedRecord> found = host::readTrace(traceSeen_);
+    if (!found.empty()) traceSeen_ = found.back().sequence + 1;
+    return found;
+  }
 
   std::vector<std::string> log; /* the module's lines, with line numbers cut out */
-  /* What the host found alive at the end of the module's heap and lock domain. */
-  std::vector<std::string> leftBehind;
+  std::vector<std::string>
+      leftBehind; /* that the module's heap and lock domain held at their end */
   sim::Simulation sim;
-
-  /* The module's own, once it is loaded. */
+  host::Module *module = nullptr;
   decltype(KARSTResolver_Create) *create_ = nullptr;
   decltype(KARSTResolver_Destroy) *destroy_ = nullptr;
   decltype(KARSTResolver_SetCallback) *setCallback_ = nullptr;
   decltype(KARSTResolver_GetNodeLocators) *read_ = nullptr;
 
  private:
-  host::Module *module_ = nullptr;
   uint64_t traceSeen_ = 0;
 };
+
+/* A test that has a bench of its own. */
+class ModuleTest : public ::testing::Test, protected Bench {};

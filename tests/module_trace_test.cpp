@@ -9,6 +9,7 @@
 using sim::Call;
 using ::testing::_;
 using ::testing::ElementsAre;
+using ::testing::Field;
 using ::testing::SizeIs;
 using ::testing::StartsWith;
 
@@ -21,14 +22,14 @@ class Trace : public ModuleTest {
   void SetUp() override {
     putSimpleNode(1);
     start();
-    ASSERT_EQ(createForNode(client_, 1), ZEL_OK);
+    ASSERT_EQ(create(client_, noUUID, nodeUUID(1)), ZEL_OK);
     traced();
   }
   void TearDown() override { destroy(client_); }
 
   /* Emits SetCallback `times` times and nothing else. */
   void emit(unsigned times = 1) {
-    for (unsigned i = 0; i < times; i++) removeCallback(client_);
+    for (unsigned i = 0; i < times; i++) setCallback(client_, false);
   }
   uint64_t bucketsAsked() {
     return sim.uses(Call::TokenBucket_UseTokensMini) + sim.uses(Call::TokenBucket_UseTokens);
@@ -53,14 +54,12 @@ class Text {
 
  private:
   std::string wordOf(uint64_t word) {
-    if (word == nodeUUID(0).bytes[0]) return "node";
-    if (word == netIfUUID(0).bytes[0]) return "netif";
-    if (word == objectUUID(0).bytes[0]) return "object";
     if (word << 8 == 0 && word != 0) return host::formatText("#%u", unsigned(word >> 56));
-    if (word < 0x10000) return std::to_string(word);
-    return host::formatText("p%zu", known_.try_emplace(word, known_.size() + 1).first->second);
+    if (known_.count(word) == 0 && word < 0x10000) return std::to_string(word);
+    return known_.try_emplace(word, "p" + std::to_string(known_.size() - 2)).first->second;
   }
-  std::map<uint64_t, size_t> known_;
+  /* The kinds of UUIDs by their first byte, and the addresses. */
+  std::map<uint64_t, std::string> known_{{0xa0, "node"}, {0xb0, "netif"}, {0xc0, "object"}};
 };
 
 class Events : public ModuleTest {};
@@ -73,7 +72,7 @@ TEST_F(Events, SayWhatHappened) {
   putObject(1, 2);
   start();
   Client client;
-  ASSERT_EQ(createForObject(client, 1), ZEL_OK);
+  ASSERT_EQ(create(client, objectUUID(1), noUUID), ZEL_OK);
   setCallback(client);
   putHealth(2, 5, 77);
   sim.run();
@@ -141,15 +140,14 @@ TEST_F(Events, SayWhatHappened) {
 
 TEST_F(Trace, IsSelectedByClassLevelAndSwitches) {
   const struct {
-    const char *name;
     bool enabled, throttling;
     int32_t level;
     uint64_t written, asked;
   } rows[] = {
-      {"class level too low", true, true, 1, 0, 0},
-      {"stream disabled", false, true, 2, 0, 0},
-      {"throttled", true, true, 2, 60, 120},
-      {"not throttled", true, false, 2, 60, 0},
+      {true, true, 1, 0, 0}, /* an event of level 2 */
+      {false, true, 2, 0, 0},
+      {true, true, 2, 60, 120},
+      {true, false, 2, 60, 0},
   };
   for (const auto &row : rows) {
     host::setTraceEnabled(row.enabled);
@@ -157,24 +155,15 @@ TEST_F(Trace, IsSelectedByClassLevelAndSwitches) {
     host::setTraceClassLevel(37, row.level);
     const uint64_t before = bucketsAsked();
     emit(60);
-    EXPECT_THAT(traced(), SizeIs(row.written)) << row.name;
-    EXPECT_EQ(bucketsAsked() - before, row.asked) << row.name;
+    EXPECT_THAT(traced(), SizeIs(row.written)) << "class level " << row.level;
+    EXPECT_EQ(bucketsAsked() - before, row.asked) << "throttling: " << row.throttling;
   }
-}
-
-TEST_F(Trace, OfANodeThatLeavesIsWrittenAtLevelZero) {
-  host::setTraceClassLevel(37, 0);
-  directory().remove(KARST_TYPE_NET_INTERFACE, netIfUUID(1));
-  directory().remove(KARST_TYPE_NODE, nodeUUID(1));
+  for (const uint32_t traceClass : {35, 36, 37}) host::setTraceClassLevel(traceClass, 0);
+  putNode(2);
   sim.run();
-  traced();
-  destroy(client_);
-  const auto records = traced();
-  ASSERT_THAT(records, SizeIs(1));
-  EXPECT_EQ(records[0].id, 13u);
-  putSimpleNode(1);
+  directory().remove(KARST_TYPE_NODE, nodeUUID(2));
   sim.run();
-  ASSERT_EQ(createForNode(client_, 1), ZEL_OK);
+  EXPECT_THAT(traced(), ElementsAre(Field(&host::TracedRecord::id, 13))) << "of level 0 alone";
 }
 
 /* ---- Throttling ------------------------------------------------------------------------------ */
@@ -182,18 +171,17 @@ TEST_F(Trace, OfANodeThatLeavesIsWrittenAtLevelZero) {
 TEST_F(Trace, SaysOnceThatABucketRunsDry) {
   const uint64_t kind = SET_CALLBACK * 64 + 8;
   const struct {
-    const char *name;
     uint64_t perEvent, global;
     std::vector<uint32_t> sites; /* of the records */
     uint64_t suppressed;         /* as the last one says */
     uint64_t globalAsked;
   } rows[] = {
-      {"the event's bucket", 3, 1000, {621, 621, 407}, kind, 3},
-      {"the stream's bucket", 1000, 3, {621, 621, 430}, 0, 10},
-      {"both: the stream's counts", 2, 2, {621, 430}, 0, 2},
+      {3, 1000, {621, 621, 407}, kind, 3},
+      {1000, 3, {621, 621, 430}, 0, 10},
+      {2, 2, {621, 430}, 0, 2}, /* both: the stream's counts */
   };
   for (const auto &row : rows) {
-    SCOPED_TRACE(row.name);
+    SCOPED_TRACE(row.perEvent);
     host::TraceSettings settings = sim.settings().tracing;
     settings.throttling = true;
     settings.perEventBurst = row.perEvent;
@@ -213,12 +201,8 @@ TEST_F(Trace, SaysOnceThatABucketRunsDry) {
     EXPECT_EQ(notice.id, row.suppressed ? Trace_GetPerTraceThrottledTraceId()
                                         : Trace_GetGlobalThrottledTraceId());
     EXPECT_GT(notice.payload[0], 0u) << "nanoseconds until there is a token";
-    EXPECT_LE(notice.payload[0], 1'000'000'000u);
     EXPECT_THAT(std::vector(notice.payload + 1, std::end(notice.payload)),
                 ElementsAre(row.suppressed, 0, 0, 0, 0));
-    sim.advance(std::chrono::seconds(3));
-    emit();
-    EXPECT_EQ(host::readTrace().back().site, 621u) << "there are tokens again";
   }
 }
 
@@ -243,8 +227,8 @@ TEST_F(Trace, RingHoldsTheFixedLayoutOverLaps) {
     EXPECT_EQ(record.word1 >> 6 & 0x3fff, SET_CALLBACK);
     EXPECT_EQ(record.word1 >> 20 & 0x7fff, 621u);
     EXPECT_EQ(record.word1 >> 35, sequence);
-    EXPECT_THAT(record.payload,
-                ElementsAre(reinterpret_cast<uint64_t>(client_.instance), 0, 0, 0, 0, 0));
+    EXPECT_THAT(record.payload, ElementsAre(reinterpret_cast<uint64_t>(client_.instance), 0,
+                                            reinterpret_cast<uint64_t>(&client_), 0, 0, 0));
   }
   EXPECT_THAT(processors, ElementsAre(0, 1, 2, 3, 4, 5, 6, 7)) << "each fiber has another one";
   host::configureTracing(sim.settings().tracing);

@@ -284,7 +284,7 @@ void Cluster::create(uint8_t number, uint8_t target, uint8_t options) {
   loaded_.take();
   const zel_Status status =
       functions_.create(&client.instance, objectType, objectWanted, nodeWanted, local);
-  lockstep_.created(status);
+  lockstep_.created(status, client.instance);
   client.made.give();
   used_.give();
   client.users = 0;

@@ -1,5 +1,5 @@
 /* The model beside the module; see lockstep.h. Every member of the module that is read here is read
- * where its lock is held or nothing runs, which the analysis cannot see.
+ * where its lock is held or nothing runs.
  */
 #include "tests/scenarios/lockstep.h"
 
@@ -20,34 +20,31 @@ bool isCacheLock(const sim::Spinlock &lock) {
   return std::strcmp(lock.name.text, cacheLockName) == 0;
 }
 
-uint8_t typeOf(const char *record) {
-  if (std::strcmp(record, "KarstNodeEntry") == 0) return KARST_TYPE_NODE;
-  if (std::strcmp(record, "KarstNetInterfaceEntry") == 0) return KARST_TYPE_NET_INTERFACE;
-  return KARST_TYPE_HEALTH_STATUS;
-}
-
-size_t sizeOf(uint8_t type) {
-  if (type == KARST_TYPE_NODE) return sizeof(KarstNodeEntry);
-  if (type == KARST_TYPE_NET_INTERFACE) return sizeof(KarstNetInterfaceEntry);
-  return sizeof(KarstHealthStatusEntry);
+/* By the name of its layout: the type of a record, and its size. */
+std::pair<uint8_t, size_t> kindOf(const std::string_view record) {
+  if (record == "KarstNodeEntry") return {KARST_TYPE_NODE, sizeof(KarstNodeEntry)};
+  if (record == "KarstNetInterfaceEntry")
+    return {KARST_TYPE_NET_INTERFACE, sizeof(KarstNetInterfaceEntry)};
+  return {KARST_TYPE_HEALTH_STATUS, sizeof(KarstHealthStatusEntry)};
 }
 
 std::string name(const zel_UUID &uuid) {
   return host::toString(uuid);
 }
 
-/* "<what> of <whose> is <real> and should be <wanted>" */
-template <typename Value>
-void require(Value real, Value wanted, const char *what, const zel_UUID &whose) {
+void require(uint64_t real, uint64_t wanted, const char *what, const zel_UUID &whose = {}) {
   if (real == wanted) return;
-  host::panic("lockstep: %s of %s is %lld, and should be %lld", what, name(whose).c_str(),
-              static_cast<long long>(real), static_cast<long long>(wanted));
+  host::panic("lockstep: %s%s is %llu, and should be %llu", what,
+              host::isZero(whose) ? "" : (" of " + name(whose)).c_str(),
+              static_cast<unsigned long long>(real), static_cast<unsigned long long>(wanted));
 }
 
-void requireSections(unsigned sections, unsigned wanted) {
-  if (sections == wanted) return;
-  host::panic("lockstep: a callback has passed through %u critical sections, not %u", sections,
-              wanted);
+void requireAnswer(const model::Answer &wanted, uint32_t state,
+                   const KARSTResolverNodeLocators &set, const zel_UUID &node) {
+  const model::Answer real = model::Answer::of(state, set);
+  if (real != wanted)
+    host::panic("lockstep: %s answers \"%s\", and should \"%s\"", name(node).c_str(),
+                real.text().c_str(), wanted.text().c_str());
 }
 
 /* In use, by its tag. */
@@ -56,48 +53,27 @@ bool isTagged(const Slot &slot, const char *tag) {
   return std::memcmp(slot.tag, tag, sizeof slot.tag) == 0;
 }
 
-/* The module's and the model's are the same. */
-template <typename Element, typename Slot>
-bool isAt(const Element &element, const Slot &slot) {
-  return element.slot ? element.slot == &slot : element.uuid == slot.uuid;
-}
-
-template <typename Element, typename Slot>
-void requireAt(const Element &element, const Slot &slot) {
-  if (!isAt(element, slot))
-    host::panic("lockstep: %s stands on a list where %s should", name(slot.uuid).c_str(),
-                name(element.uuid).c_str());
-}
-
 /* Each on a list beside the one that it should be. `links`: where an element has its own. */
 template <typename Real, typename Wanted, typename Compare>
 void compareList(const Wanted &wanted, const KARSTResolverLink &head, size_t links,
                  const char *what, const zel_UUID &whose, Compare compare) {
-  auto next = wanted.begin();
-  for (KARSTResolverLink *link = head.next; link != &head; link = link->next) {
-    if (next == wanted.end())
-      host::panic("lockstep: there are more %s of %s than there should be", what,
-                  name(whose).c_str());
-    compare(**next++, *reinterpret_cast<Real *>(reinterpret_cast<uint8_t *>(link) - links));
+  size_t length = 0;
+  for (KARSTResolverLink *link = head.next; link != &head && length <= wanted.size();
+       link = link->next) {
+    if (length < wanted.size())
+      compare(*wanted[length],
+              *reinterpret_cast<Real *>(reinterpret_cast<uint8_t *>(link) - links));
+    ++length;
   }
-  if (next != wanted.end())
-    host::panic("lockstep: there are fewer %s of %s than there should be", what,
-                name(whose).c_str());
+  require(length, wanted.size(), what, whose);
 }
 
-/* A list begins and ends with those that it should. */
-template <typename Real, typename Wanted>
-void requireEnds(const Wanted &wanted, const KARSTResolverLink &head, size_t links,
-                 const char *what) {
-  const auto is = [&](const KARSTResolverLink *link, const auto *element) {
-    const auto *bytes = reinterpret_cast<const uint8_t *>(link) - links;
-    return link != &head && isAt(*element, *reinterpret_cast<const Real *>(bytes));
-  };
-  if (wanted.empty() ? head.next == &head
-                     : is(head.next, wanted.front()) && is(head.previous, wanted.back()))
-    return;
-  host::panic("lockstep: another %s than it should is the first or last one", what);
-}
+/* Where the order is all that counts. */
+const auto sameUUID = [](const auto &element, const auto &slot) {
+  if (element.uuid != slot.uuid)
+    host::panic("lockstep: %s stands on a list where %s should", name(slot.uuid).c_str(),
+                name(element.uuid).c_str());
+};
 
 }  // namespace
 
@@ -113,59 +89,53 @@ void Lockstep::statusRegistered(sim::Fiber &, void *data, zel_Status status) {
 }
 
 void Lockstep::moduleComesOrGoes() {
-  begin(simulation_.scheduler().running(), Activity::Disable);
+  begin(Activity::Disable);
 }
 
 void Lockstep::moduleIsGone() {
-  end(simulation_.scheduler().running());
-  if (!activities_.empty())
-    host::panic("lockstep: the module is gone, and fiber %u is still inside it",
-                activities_.front().fiber);
+  end();
+  require(activities_.size(), 0, "the number of fibers inside a module that is gone");
+  require(alive_.size(), 0, "the number of instances of a module that is gone");
+  require(cacheSubscriptions_, 0, "the number of subscriptions of a module that is gone");
+  if (model_)
+    require(model_->nodes.size() + model_->slots.size(), 0,
+            "the number of entries of a module that is gone");
   cache_ = nullptr;
-  if (!alive_.empty()) host::panic("lockstep: the module is gone, and an instance is not");
-  if (model_ && (!model_->nodes.empty() || !model_->slots.empty() || cacheSubscriptions_ != 0))
-    host::panic(
-        "lockstep: the module is gone, and %zu nodes, %zu interfaces, %zu subscriptions not",
-        model_->nodes.size(), model_->slots.size(), cacheSubscriptions_);
   model_.reset();
 }
 
 void Lockstep::moduleIsThere() {
-  end(simulation_.scheduler().running());
+  end();
 }
 
 /* ---- What fibers do -------------------------------------------------------------------------- */
 
-Lockstep::Activity &Lockstep::begin(const sim::Fiber &fiber, Activity::Kind kind) {
-  Activity *before = find(fiber.id());
-  Activity &activity = before ? *before : activities_.emplace_back();
-  activity = Activity{};
-  activity.fiber = fiber.id();
-  activity.kind = kind;
-  return activity;
+uint32_t Lockstep::fiber() const {
+  return simulation_.scheduler().running().id();
 }
 
-Lockstep::Activity *Lockstep::find(uint32_t fiber) {
+Lockstep::Activity &Lockstep::begin(Activity::Kind kind) {
+  end();
+  return activities_.emplace_back(Activity{.fiber = fiber(), .kind = kind});
+}
+
+/* A world begins by itself. */
+Lockstep::Activity *Lockstep::current() {
   for (Activity &activity : activities_)
-    if (activity.fiber == fiber) return &activity;
-  return nullptr;
+    if (activity.fiber == fiber()) return &activity;
+  return simulation_.scheduler().running().world ? &begin(Activity::World) : nullptr;
 }
 
-Lockstep::Activity *Lockstep::of(const sim::Fiber &fiber) {
-  if (Activity *activity = find(fiber.id())) return activity;
-  return fiber.world ? &begin(fiber, Activity::World) : nullptr;
+void Lockstep::end() {
+  std::erase_if(activities_, [&](const Activity &one) { return one.fiber == fiber(); });
 }
 
-void Lockstep::end(const sim::Fiber &fiber) {
-  std::erase_if(activities_, [&](const Activity &one) { return one.fiber == fiber.id(); });
-}
-
-void Lockstep::subscriptionCalls(sim::Fiber &fiber, const sim::SubscriptionCall &call) {
+void Lockstep::subscriptionCalls(sim::Fiber &, const sim::SubscriptionCall &call) {
   const Activity::Kind kind = call.type == KARST_TYPE_NODE            ? Activity::Nodes
                               : call.type == KARST_TYPE_NET_INTERFACE ? Activity::NetIfs
                               : call.type == KARST_TYPE_HEALTH_STATUS ? Activity::Health
                                                                       : Activity::Object;
-  Activity &activity = begin(fiber, kind);
+  Activity &activity = begin(kind);
   activity.header = *call.header;
   activity.status = call.status;
   activity.data = call.data;
@@ -180,34 +150,34 @@ void Lockstep::subscriptionCalls(sim::Fiber &fiber, const sim::SubscriptionCall 
   }
 }
 
-void Lockstep::subscriptionReturned(sim::Fiber &fiber, const sim::SubscriptionCall &call) {
-  Activity &activity = *find(fiber.id());
+void Lockstep::subscriptionReturned(sim::Fiber &, const sim::SubscriptionCall &call) {
+  Activity &activity = *current();
   const bool cancelled = call.status == ZEL_SUB_CANCELLED;
   switch (activity.kind) {
     case Activity::Nodes:
     case Activity::NetIfs:
       if (cancelled) --cacheSubscriptions_;
-      requireSections(activity.sections, cancelled ? 0 : 1);
+      require(activity.sections, cancelled ? 0 : 1, "the number of sections in a call");
       break;
     case Activity::Health:
-      requireSections(activity.sections, 1);
+      require(activity.sections, 1, "the number of sections in a call");
       break;
     default:
       if (!cancelled) objectReturned(activity);
   }
-  end(fiber);
+  end();
 }
 
-void Lockstep::statusCalls(sim::Fiber &fiber, uint32_t status) {
-  begin(fiber, status & KARST_STATUS_USABLE ? Activity::Enable : Activity::Disable);
+void Lockstep::statusCalls(sim::Fiber &, uint32_t status) {
+  begin(status & KARST_STATUS_USABLE ? Activity::Enable : Activity::Disable);
 }
 
-void Lockstep::statusReturned(sim::Fiber &fiber, uint32_t) {
-  const Activity &activity = *find(fiber.id());
+void Lockstep::statusReturned(sim::Fiber &, uint32_t) {
+  const Activity &activity = *current();
   const bool enabling = activity.kind == Activity::Enable && !activity.failed;
   if (enabling ? activity.sections != 2 : activity.disabling == 1)
     host::panic("lockstep: a status call has ended half-way");
-  end(fiber);
+  end();
 }
 
 model::Instance &Lockstep::creating(const zel_UUID &object, const zel_UUID &node, bool local) {
@@ -215,7 +185,7 @@ model::Instance &Lockstep::creating(const zel_UUID &object, const zel_UUID &node
   alive_.push_back(&instance);
   instance.object = object;
   instance.local = local;
-  Activity &activity = begin(simulation_.scheduler().running(), Activity::Create);
+  Activity &activity = begin(Activity::Create);
   activity.instance = &instance;
   if (host::isZero(object)) {
     activity.wanted = node;
@@ -226,49 +196,50 @@ model::Instance &Lockstep::creating(const zel_UUID &object, const zel_UUID &node
   return instance;
 }
 
-void Lockstep::created(zel_Status status) {
-  Activity &activity = *find(simulation_.scheduler().running().id());
-  model::Instance &instance = *activity.instance;
-  const bool good = status == ZEL_OK ? !instance.destroyed && !activity.failed
-                                     : instance.destroyed || activity.sections == 0;
+void Lockstep::created(zel_Status status, KARSTResolverInstance *real) {
+  const Activity &activity = *current();
+  Known &made = known(*activity.instance);
+  const bool good = status == ZEL_OK ? !made.destroyed && !activity.failed
+                                     : made.destroyed || activity.sections == 0;
   if (!good)
     host::panic("lockstep: create returned 0x%x after %u sections, destroyed %d", status,
-                activity.sections, instance.destroyed);
+                activity.sections, made.destroyed);
   if (activity.sections > 0) ++counts_.creates;
   if (status == ZEL_OK) {
-    requireResolved(known(instance));
+    made.real = real;
+    requireResolved(made);
   } else {
     if (activity.sections > 0) ++counts_.destroys;
-    std::erase(alive_, &known(instance));
+    std::erase(alive_, &made);
   }
-  end(simulation_.scheduler().running());
+  end();
 }
 
 /* At some time since its first tracking; perhaps by a section that has not ended. */
-void Lockstep::requireResolved(Known &made) KARST_UNCHECKED {
+void Lockstep::requireResolved(Known &made) {
   for (const model::Answer &one : made.answers)
     if (one.state == KARST_RESOLVER_STATE_RESOLVED) return;
-  if (!made.real || made.real->state != KARST_RESOLVER_STATE_RESOLVED)
+  if (made.real->state != KARST_RESOLVER_STATE_RESOLVED)
     host::panic("lockstep: create succeeded, and the instance never was resolved");
   made.expected.push_back(model::Answer::of(made.real->state, made.real->locators));
 }
 
 void Lockstep::destroying(model::Instance &instance) {
-  begin(simulation_.scheduler().running(), Activity::Destroy).instance = &instance;
+  begin(Activity::Destroy).instance = &instance;
 }
 
 void Lockstep::destroyed() {
-  Activity &activity = *find(simulation_.scheduler().running().id());
-  if (activity.sections != 1) host::panic("lockstep: destroy took %u sections", activity.sections);
+  Activity &activity = *current();
+  require(activity.sections, 1, "the number of sections in a destroy");
   ++counts_.destroys;
   std::erase(alive_, &known(*activity.instance));
-  end(simulation_.scheduler().running());
+  end();
 }
 
 /* ---- What the platform answers --------------------------------------------------------------- */
 
-void Lockstep::lookedUp(sim::Fiber &fiber, const sim::Lookup &lookup) {
-  Activity *activity = of(fiber);
+void Lockstep::lookedUp(sim::Fiber &, const sim::Lookup &lookup) {
+  Activity *activity = current();
   if (!activity) return;
   const KarstEntryHeader header = lookup.header ? *lookup.header : KarstEntryHeader{};
   if (activity->instance) { /* the object's entry */
@@ -286,27 +257,25 @@ void Lockstep::lookedUp(sim::Fiber &fiber, const sim::Lookup &lookup) {
   activity->inputs.add({kind, lookup.type, lookup.uuid, lookup.status, header, {}, nullptr});
 }
 
-void Lockstep::decoded(sim::Fiber &fiber, const char *record, zel_Status status,
-                       const void *content) {
-  Activity *activity = of(fiber);
+void Lockstep::decoded(sim::Fiber &, const char *record, zel_Status status, const void *content) {
+  Activity *activity = current();
   if (!activity) return;
-  const uint8_t type = typeOf(record);
+  const auto [type, size] = kindOf(record);
   const auto *bytes = static_cast<const uint8_t *>(content);
   activity->inputs.add(
-      {model::Input::Decoded, type, {}, status, {}, {bytes, bytes + sizeOf(type)}, nullptr});
+      {model::Input::Decoded, type, {}, status, {}, {bytes, bytes + size}, nullptr});
 }
 
-void Lockstep::toldSelf(sim::Fiber &fiber, const zel_UUID &uuid) {
-  if (Activity *activity = of(fiber)) {
+void Lockstep::toldSelf(sim::Fiber &, const zel_UUID &uuid) {
+  if (Activity *activity = current()) {
     KarstEntryHeader header{};
     header.uuid = uuid;
     activity->inputs.add({model::Input::Self, 0, {}, ZEL_OK, header, {}, nullptr});
   }
 }
 
-void Lockstep::subscribed(sim::Fiber &fiber, const KarstQuery &query, void *data,
-                          zel_Status status) {
-  Activity *activity = of(fiber);
+void Lockstep::subscribed(sim::Fiber &, const KarstQuery &query, void *data, zel_Status status) {
+  Activity *activity = current();
   if (!activity) return;
   switch (query.type) {
     case KARST_TYPE_HEALTH_STATUS:
@@ -319,37 +288,38 @@ void Lockstep::subscribed(sim::Fiber &fiber, const KarstQuery &query, void *data
       activity->failed |= status != ZEL_OK;
       return;
     default: /* the object's, in a create; calls may come from here on */
+      known(*activity->instance).real = static_cast<KARSTResolverInstance *>(data);
       if (activity->found) activity->instance->useHint = false;
       activity->failed |= status != ZEL_OK;
   }
 }
 
-void Lockstep::worldCreated(sim::Fiber &fiber, zel_Status status) {
-  if (Activity *activity = of(fiber)) activity->failed |= status != ZEL_OK;
+void Lockstep::worldCreated(sim::Fiber &, zel_Status status) {
+  if (Activity *activity = current()) activity->failed |= status != ZEL_OK;
 }
 
-void Lockstep::worldWaited(sim::Fiber &fiber, zel_Status status) {
+void Lockstep::worldWaited(sim::Fiber &, zel_Status status) {
   if (status != ZEL_WORLD_STOPPING) return;
   model_->worldEnds();
-  end(fiber);
+  end();
 }
 
-void Lockstep::preemptionAnswered(sim::Fiber &fiber, bool yes) {
-  if (Activity *activity = of(fiber))
+void Lockstep::preemptionAnswered(sim::Fiber &, bool yes) {
+  if (Activity *activity = current())
     activity->inputs.add({model::Input::Preemption, 0, {}, yes, {}, {}, nullptr});
 }
 
 /* ---- Sections -------------------------------------------------------------------------------- */
 
 void Lockstep::locked(sim::Fiber &fiber, const sim::Spinlock &lock) {
-  if (isCacheLock(lock) && !of(fiber))
+  if (isCacheLock(lock) && !current())
     host::panic("lockstep: %s takes the cache lock for no reason that is known",
                 fiber.name().c_str());
 }
 
 void Lockstep::unlocking(sim::Fiber &fiber, const sim::Spinlock &lock) {
   if (!isCacheLock(lock) || !cache_) return;
-  Activity &activity = *of(fiber);
+  Activity &activity = *current();
   step(activity);
   ++activity.sections;
   ++sections_;
@@ -479,42 +449,18 @@ void Lockstep::answersGrew() {
 
 /* ---- Comparison ------------------------------------------------------------------------------ */
 
-/* Where every access is watched, everything after each section. Else what the section has touched,
- * and everything at every sixteenth, or later where much is held, so that this takes no longer than
- * the sections themselves: what was written to where it does not belong is found a little later, and
- * many more sections are played. */
+/* Everything: after each section where every access is watched. Else after every eighth, or later
+ * where much is held, so that this takes no longer than the sections themselves: a difference is
+ * found a little later, and many more sections are played. */
 void Lockstep::compareSection() {
-  ++checks_;
   const size_t held = model_->nodes.size() + model_->netIfs.size();
-  const size_t touched = model_->touchedNodes.size() + model_->touchedNetIfs.size();
-  if (sim::access::watching || ++sectionsSinceWhole_ >= std::max<size_t>(16, held / 4) ||
-      touched > held / 4 + 8) {
-    compareWhole();
-  } else {
-    compareTouched();
-  }
-  model_->touchedNodes.clear();
-  model_->touchedNetIfs.clear();
+  if (sim::access::watching || ++sectionsSinceCompared_ >= std::max<size_t>(8, held / 4)) compare();
 }
 
-/* With the lists that they are on: of the long ones, which all share, both ends. */
-void Lockstep::compareTouched() {
-  const zel_UUID cache{};
-  require<int>(cache_->enabled, model_->enabled, "enabled", cache);
-  require<size_t>(cache_->nodeTree->data->count, model_->nodes.size(), "nodes", cache);
-  for (model::Node *node : model_->touchedNodes) compareNode(*node, realOf(*node));
-  for (model::NetIf *netIf : model_->touchedNetIfs)
-    if (netIf->node) compareNetIf(*netIf, realOf(*netIf));
-  requireEnds<KARSTResolverNetIf>(model_->netIfs, cache_->netIfs,
-                                  offsetof(KARSTResolverNetIf, cacheLinks), "interface");
-  requireEnds<KARSTResolverNode>(model_->dirty, cache_->dirtyNodes,
-                                 offsetof(KARSTResolverNode, dirtyLinks), "dirty node");
-}
-
-void Lockstep::compareWhole() {
-  sectionsSinceWhole_ = 0;
-  const zel_UUID cache{};
-  require<int>(cache_->enabled, model_->enabled, "enabled", cache);
+void Lockstep::compare() {
+  ++checks_;
+  sectionsSinceCompared_ = 0;
+  require(cache_->enabled, model_->enabled, "enabled");
   size_t inUse = 0;
   for (const KARSTResolverNode &real : std::span(cache_->nodePool, KARST_RESOLVER_NODE_POOL_SIZE)) {
     if (!isTagged(real, KARST_RESOLVER_TAG_NODE)) continue;
@@ -524,93 +470,56 @@ void Lockstep::compareWhole() {
       host::panic("lockstep: node %s is cached and should not be", name(real.uuid).c_str());
     compareNode(*found->second, real);
   }
-  require(inUse, model_->nodes.size(), "nodes", cache);
-
-  compareList<KARSTResolverNetIf>(
-      model_->netIfs, cache_->netIfs, offsetof(KARSTResolverNetIf, cacheLinks), "interfaces", cache,
-      [&](model::NetIf &netIf, KARSTResolverNetIf &real) { compareNetIf(netIf, real); });
+  require(inUse, model_->nodes.size(), "the number of nodes");
+  compareList<KARSTResolverNetIf>(model_->netIfs, cache_->netIfs,
+                                  offsetof(KARSTResolverNetIf, cacheLinks),
+                                  "the number of interfaces", {}, compareNetIf);
   compareList<KARSTResolverNode>(model_->dirty, cache_->dirtyNodes,
-                                 offsetof(KARSTResolverNode, dirtyLinks), "dirty nodes", cache,
-                                 requireAt<model::Node, KARSTResolverNode>);
+                                 offsetof(KARSTResolverNode, dirtyLinks),
+                                 "the number of dirty nodes", {}, sameUUID);
 }
 
-/* A new one is looked for: any slot may be its. */
-const KARSTResolverNode &Lockstep::realOf(const model::Node &node) const {
-  if (node.slot) return *static_cast<const KARSTResolverNode *>(node.slot);
-  for (const KARSTResolverNode &real : std::span(cache_->nodePool, KARST_RESOLVER_NODE_POOL_SIZE))
-    if (real.uuid == node.uuid && isTagged(real, KARST_RESOLVER_TAG_NODE)) return real;
-  host::panic("lockstep: node %s is not cached and should be", name(node.uuid).c_str());
-}
-
-/* A new one stands at the end. */
-const KARSTResolverNetIf &Lockstep::realOf(const model::NetIf &netIf) const {
-  if (netIf.slot) return *static_cast<const KARSTResolverNetIf *>(netIf.slot);
-  for (const KARSTResolverLink *link = cache_->netIfs.previous; link != &cache_->netIfs;
-       link = link->previous) {
-    const auto &real = *KARST_RESOLVER_CONTAINER(link, KARSTResolverNetIf, cacheLinks);
-    if (real.uuid == netIf.uuid && real.node && isAt(*netIf.node, *real.node)) return real;
-  }
-  host::panic("lockstep: interface %s is not cached and should be", name(netIf.uuid).c_str());
-}
-
-void Lockstep::compareNode(model::Node &node, const KARSTResolverNode &real) {
+void Lockstep::compareNode(const model::Node &node, const KARSTResolverNode &real) {
   const zel_UUID &uuid = node.uuid;
-  if (!node.slot) node.slot = &real;
-  if (node.slot != &real || real.uuid != uuid || !isTagged(real, KARST_RESOLVER_TAG_NODE))
-    host::panic("lockstep: node %s is not where it was", name(uuid).c_str());
-  require<unsigned>(real.refCount, node.references, "references", uuid);
-  require<int>(real.reachable, node.reachable, "reachable", uuid);
-  require<int>(real.isSelf, node.self, "isSelf", uuid);
-  require<int>(real.isWitness, node.witness, "isWitness", uuid);
-  require<int>(real.rescanSeen, 0, "rescanSeen", uuid);
-  require<int>(real.dirtyLinks.next != nullptr, node.dirty, "dirty", uuid);
+  require(real.refCount, node.references, "refCount", uuid);
+  require(real.reachable, node.reachable, "reachable", uuid);
+  require(real.isSelf, node.self, "isSelf", uuid);
+  require(real.isWitness, node.witness, "isWitness", uuid);
+  require(real.rescanSeen, 0, "rescanSeen", uuid);
+  require(real.dirtyLinks.next != nullptr, node.dirty, "dirty", uuid);
   require(real.majorVersion, node.major, "majorVersion", uuid);
   require(real.minorVersion, node.minor, "minorVersion", uuid);
   compareList<KARSTResolverNetIf>(node.netIfs, real.netIfList,
-                                  offsetof(KARSTResolverNetIf, nodeLinks), "interfaces", uuid,
-                                  requireAt<model::NetIf, KARSTResolverNetIf>);
+                                  offsetof(KARSTResolverNetIf, nodeLinks),
+                                  "the number of interfaces", uuid, sameUUID);
   compareList<KARSTResolverInstance>(node.instances, real.instanceList,
-                                     offsetof(KARSTResolverInstance, nodeLinks), "instances", uuid,
-                                     [](model::Instance &instance, KARSTResolverInstance &own) {
-                                       compareInstance(known(instance), own);
-                                     });
-  if (!node.set.is(node.set.state, real.locators))
-    host::panic("lockstep: the locators of %s are \"%s\", and should be \"%s\"", name(uuid).c_str(),
-                model::Answer::of(node.set.state, real.locators).text().c_str(),
-                node.set.text().c_str());
+                                     offsetof(KARSTResolverInstance, nodeLinks),
+                                     "the number of instances", uuid, compareInstance);
+  requireAnswer(node.set, node.set.state, real.locators, uuid);
 }
 
-void Lockstep::compareNetIf(model::NetIf &netIf, const KARSTResolverNetIf &real) {
+void Lockstep::compareNetIf(const model::NetIf &netIf, const KARSTResolverNetIf &real) {
+  sameUUID(netIf, real);
   const zel_UUID &uuid = netIf.uuid;
-  if (!netIf.slot) netIf.slot = &real;
-  if (netIf.slot != &real || real.uuid != uuid)
-    host::panic("lockstep: interface %s is out of order", name(uuid).c_str());
-  if (!real.node || !isAt(*netIf.node, *real.node))
+  if (!real.node || real.node->uuid != netIf.node->uuid)
     host::panic("lockstep: interface %s has another owner", name(uuid).c_str());
-  require<unsigned>(real.refCount, netIf.references, "references", uuid);
-  require<int>(real.healthy, netIf.healthy, "healthy", uuid);
-  require<int>(real.healthSubInstalled, netIf.watched, "healthSubInstalled", uuid);
-  require<int>(real.rescanSeen, 0, "rescanSeen", uuid);
+  require(real.refCount, netIf.references, "refCount", uuid);
+  require(real.healthy, netIf.healthy, "healthy", uuid);
+  require(real.healthSubInstalled, netIf.watched, "healthSubInstalled", uuid);
+  require(real.rescanSeen, 0, "rescanSeen", uuid);
   require(real.health.healthFlags, netIf.health.healthFlags, "healthFlags", uuid);
   if (std::memcmp(&real.info, &netIf.info, sizeof real.info) != 0)
     host::panic("lockstep: the record of interface %s differs", name(uuid).c_str());
 }
 
-void Lockstep::compareInstance(Known &instance, KARSTResolverInstance &real) {
-  if (!instance.real) instance.real = &real; /* its first attachment */
-  if (instance.real != &real) host::panic("lockstep: a node's instances are out of order");
-  require<int>(real.nodeChanged, instance.changed, "nodeChanged", instance.bound);
+void Lockstep::compareInstance(model::Instance &instance, KARSTResolverInstance &real) {
+  KARSTResolverInstance *&own = known(instance).real;
+  if (!own) own = &real; /* its first attachment */
+  if (own != &real) host::panic("lockstep: a node's instances are out of order");
+  require(real.nodeChanged, instance.changed, "nodeChanged", instance.bound);
   if (real.boundNodeUUID != instance.bound || real.node->uuid != instance.node->uuid)
     host::panic("lockstep: an instance is bound elsewhere");
-  requireAnswer(instance);
-}
-
-void Lockstep::requireAnswer(const Known &instance) KARST_UNCHECKED {
-  const KARSTResolverInstance &real = *instance.real;
-  if (!instance.answer().is(real.state, real.locators))
-    host::panic("lockstep: an instance answers \"%s\", and should \"%s\"",
-                model::Answer::of(real.state, real.locators).text().c_str(),
-                instance.answer().text().c_str());
+  requireAnswer(instance.answer(), real.state, real.locators, instance.bound);
 }
 
 /* ---- At rest --------------------------------------------------------------------------------- */
@@ -620,26 +529,22 @@ void Lockstep::atRest() {
     if (activity.kind != Activity::World)
       host::panic("lockstep: a fiber is still inside the module");
   if (!cache_) return;
-  compareWhole();
-  const zel_UUID cache{};
+  compare();
   for (const Known &known : instances_)
     if (!known.expected.empty())
       host::panic("lockstep: a client saw \"%s\", which the instance never had",
                   known.expected.front().text().c_str());
   for (const Known *known : alive_) {
-    requireAnswer(*known);
-    require<uint64_t>(known->real->refCount, host::isZero(known->object) ? 1 : 2,
-                      "references of an instance", known->bound);
+    requireAnswer(known->answer(), known->real->state, known->real->locators, known->bound);
+    require(known->real->refCount, host::isZero(known->object) ? 1 : 2, "refCount of an instance",
+            known->bound);
   }
-  require<uint64_t>(cache_->refCount, cacheSubscriptions_ + model_->followed.size() + alive_.size(),
-                    "references of the cache", cache);
+  require(cache_->refCount, cacheSubscriptions_ + model_->followed.size() + alive_.size(),
+          "refCount of the cache");
   const std::span slots(cache_->netIfPool, KARST_RESOLVER_NETIF_POOL_SIZE);
   const auto inUse = std::count_if(slots.begin(), slots.end(), [](const auto &slot) {
     return isTagged(slot, KARST_RESOLVER_TAG_NETIF);
   });
-  require(static_cast<size_t>(inUse), model_->slots.size(), "slots of interfaces", cache);
-  if (!model_->enabled) return;
-  if (!model_->dirty.empty())
-    host::panic("lockstep: node %s is dirty and nobody works on it",
-                name(model_->dirty.front()->uuid).c_str());
+  require(static_cast<uint64_t>(inUse), model_->slots.size(), "the number of interfaces in slots");
+  if (model_->enabled) require(model_->dirty.size(), 0, "the number of nodes that wait for work");
 }

@@ -24,7 +24,7 @@ class Lockstep final : public sim::Observer {
 
   /* Around the client's calls, on the fiber that makes them. The model's instances stay for ever. */
   model::Instance &creating(const zel_UUID &object, const zel_UUID &node, bool local);
-  void created(zel_Status status);
+  void created(zel_Status status, KARSTResolverInstance *real);
   void destroying(model::Instance &instance);
   void destroyed();
 
@@ -74,10 +74,10 @@ class Lockstep final : public sim::Observer {
     const void *data = nullptr;
     model::Instance *instance = nullptr;
     unsigned sections = 0; /* ended */
-    model::Inputs inputs;
+    model::Inputs inputs{};
 
-    std::optional<zel_UUID> wanted; /* the node to track, once that is known */
-    bool found = false;             /* the object's entry */
+    std::optional<zel_UUID> wanted{}; /* the node to track, once that is known */
+    bool found = false;               /* the object's entry */
     bool tracked = false;
     bool mayStay = false; /* at some moment since, there was nothing to change */
     bool mayMove = false; /* at some moment since, there was */
@@ -91,10 +91,11 @@ class Lockstep final : public sim::Observer {
     size_t answersCounted = 1;
   };
 
-  Activity &begin(const sim::Fiber &fiber, Activity::Kind kind);
-  Activity *of(const sim::Fiber &fiber);
-  Activity *find(uint32_t fiber);
-  void end(const sim::Fiber &fiber);
+  /* Of the fiber that runs. */
+  uint32_t fiber() const;
+  Activity &begin(Activity::Kind kind);
+  Activity *current();
+  void end();
   void step(Activity &activity);
   void stepEnable(Activity &activity);
   void stepDisable(Activity &activity);
@@ -105,14 +106,10 @@ class Lockstep final : public sim::Observer {
   void answersGrew();
 
   void compareSection();
-  void compareTouched();
-  void compareWhole();
-  void compareNode(model::Node &node, const KARSTResolverNode &real);
-  void compareNetIf(model::NetIf &netIf, const KARSTResolverNetIf &real);
-  const KARSTResolverNode &realOf(const model::Node &node) const;
-  const KARSTResolverNetIf &realOf(const model::NetIf &netIf) const;
-  static void compareInstance(Known &instance, KARSTResolverInstance &real);
-  static void requireAnswer(const Known &instance);
+  void compare();
+  static void compareNode(const model::Node &node, const KARSTResolverNode &real);
+  static void compareNetIf(const model::NetIf &netIf, const KARSTResolverNetIf &real);
+  static void compareInstance(model::Instance &instance, KARSTResolverInstance &real);
   model::Instance &instanceOf(const void *real);
   static Known &known(model::Instance &instance) { return static_cast<Known &>(instance); }
   void requireResolved(Known &made);
@@ -125,6 +122,6 @@ class Lockstep final : public sim::Observer {
   std::vector<Known *> alive_;
   size_t cacheSubscriptions_ = 0; /* of nodes and interfaces, whose last call has not returned */
   uint64_t checks_ = 0, sections_ = 0;
-  size_t sectionsSinceWhole_ = 0; /* all was compared */
+  size_t sectionsSinceCompared_ = 0;
   Counts counts_;
 };

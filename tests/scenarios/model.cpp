@@ -12,41 +12,28 @@ namespace model {
 
 /* ---- Answers --------------------------------------------------------------------------------- */
 
+void Answer::add(uint32_t type, const uint8_t *address) {
+  if (count == locators.size()) return;
+  Locator &locator = locators[count++];
+  locator.type = type;
+  if (type != KARST_RESOLVER_LOCATOR_LOCAL)
+    std::memcpy(locator.address.data(), address, type == KARST_RESOLVER_LOCATOR_IPV6 ? 16 : 4);
+}
+
 Answer Answer::of(uint32_t state, const KARSTResolverNodeLocators &set) {
-  Answer answer{state, set.nodeUUID, set.majorVersion, set.minorVersion, set.trafficType, {}};
-  for (uint16_t i = 0; i < set.count; i++) {
-    const KARSTResolverNodeLocator &locator = set.locators[i];
-    answer.locators.push_back(Locator::of(locator.networkType, locator.address));
-  }
+  Answer answer{state, set.nodeUUID, set.majorVersion, set.minorVersion, set.trafficType};
+  for (uint16_t i = 0; i < set.count; i++)
+    answer.add(set.locators[i].networkType, set.locators[i].address);
   return answer;
-}
-
-Answer::Locator Answer::Locator::of(uint32_t type, const uint8_t *address) {
-  Locator locator{type, {}};
-  const size_t length = type == KARST_RESOLVER_LOCATOR_IPV6   ? 16
-                        : type == KARST_RESOLVER_LOCATOR_IPV4 ? 4
-                                                              : 0;
-  std::memcpy(locator.address.data(), address, length);
-  return locator;
-}
-
-/* Equal to of(...), which takes memory. */
-bool Answer::is(uint32_t real, const KARSTResolverNodeLocators &set) const {
-  return state == real && node == set.nodeUUID && major == set.majorVersion &&
-         minor == set.minorVersion && trafficType == set.trafficType &&
-         std::equal(locators.begin(), locators.end(), set.locators, set.locators + set.count,
-                    [](const Locator &own, const KARSTResolverNodeLocator &other) {
-                      return own == Locator::of(other.networkType, other.address);
-                    });
 }
 
 std::string Answer::text() const {
   std::string text = host::formatText("state %u, node %s, version %u.%u, traffic %llu,", state,
                                       host::toString(node).c_str(), major, minor,
                                       static_cast<unsigned long long>(trafficType));
-  for (const Locator &locator : locators) {
-    text += host::formatText(" %u:", locator.type);
-    for (const uint8_t byte : locator.address) text += host::formatText("%02x", byte);
+  for (size_t i = 0; i < count; i++) {
+    text += host::formatText(" %u:", locators[i].type);
+    for (const uint8_t byte : locators[i].address) text += host::formatText("%02x", byte);
   }
   return text;
 }
@@ -74,7 +61,6 @@ Input Inputs::take(Input::Kind kind, uint8_t type, const zel_UUID &uuid) {
 Node *Resolver::find(const zel_UUID &uuid) {
   const auto found = nodes.find(uuid);
   if (found == nodes.end()) return nullptr;
-  touchedNodes.add(*found->second);
   return found->second.get();
 }
 
@@ -88,22 +74,18 @@ Node *Resolver::findOrCreate(const zel_UUID &uuid) {
   auto node = std::make_unique<Node>();
   node->uuid = uuid;
   node->self = uuid == self;
-  touchedNodes.add(*node);
   return (nodes[uuid] = std::move(node)).get();
 }
 
 void Resolver::mark(Node &node) {
-  touchedNodes.add(node);
   if (!enabled || node.dirty) return;
   node.dirty = true;
   dirty.push_back(&node);
 }
 
 void Resolver::release(Node *node) {
-  touchedNodes.add(*node);
   if (--node->references != 0) return;
   if (node->dirty) std::erase(dirty, node);
-  touchedNodes.remove(*node);
   nodes.erase(node->uuid);
 }
 
@@ -171,7 +153,6 @@ NetIf *Resolver::findNetIf(const zel_UUID &owner, const zel_UUID &uuid) {
   if (Node *node = find(owner))
     for (NetIf *netIf : node->netIfs) {
       if (netIf->uuid != uuid) continue;
-      touchedNetIfs.add(*netIf);
       return netIf;
     }
   return nullptr;
@@ -194,7 +175,6 @@ NetIf *Resolver::findOrCreateNetIf(const zel_UUID &owner, const zel_UUID &uuid, 
   netIfs.push_back(netIf);
   node->netIfs.push_back(netIf);
   ++node->references;
-  touchedNetIfs.add(*netIf);
   updateHealth(*netIf, inputs);
   return netIf;
 }
@@ -229,7 +209,6 @@ void Resolver::updateHealth(NetIf &netIf, Inputs &inputs) {
 
 void Resolver::releaseNetIf(NetIf &netIf) {
   if (--netIf.references != 0) return;
-  touchedNetIfs.remove(netIf);
   slots.erase(&netIf);
 }
 
@@ -279,7 +258,6 @@ void Resolver::healthCall(const void *data, zel_Status status, Inputs &inputs) {
     followed.erase(found);
     releaseNetIf(netIf);
   } else if (netIf.node) {
-    touchedNetIfs.add(netIf);
     updateHealth(netIf, inputs);
   }
 }
@@ -289,41 +267,34 @@ void Resolver::healthCall(const void *data, zel_Status status, Inputs &inputs) {
 void Resolver::generate(Node &node) {
   Answer &set = node.set;
   node.news = false;
-  set.node = node.uuid;
-  set.major = node.major;
-  set.minor = node.minor;
+  set = {.node = node.uuid, .major = node.major, .minor = node.minor};
   set.trafficType = witness_ || node.witness ? 1 : 0;
-  set.locators.clear();
   for (const NetIf *netIf : node.netIfs) {
     const KarstNetInterfaceEntry &info = netIf->info;
     if (!netIf->healthy || !(info.trafficTypeMask >> set.trafficType & 1)) continue;
     if (info.networkType != KARST_NETWORK_TYPE_IP) continue;
     const uint8_t *single = info.ipv4Address;
     if (info.numIpAddresses == 0 && (single[0] | single[1] | single[2] | single[3]))
-      set.locators.push_back(Answer::Locator::of(KARST_RESOLVER_LOCATOR_IPV4, single));
+      set.add(KARST_RESOLVER_LOCATOR_IPV4, single);
     for (uint32_t i = 0; i < std::min(info.numIpAddresses, 7u); i++) {
       const KarstIpAddress &address = info.ipAddresses[i];
-      set.locators.push_back(Answer::Locator::of(
-          address.isIPv6 ? KARST_RESOLVER_LOCATOR_IPV6 : KARST_RESOLVER_LOCATOR_IPV4,
-          address.address));
+      set.add(address.isIPv6 ? KARST_RESOLVER_LOCATOR_IPV6 : KARST_RESOLVER_LOCATOR_IPV4,
+              address.address);
     }
   }
-  if (set.locators.size() > KARST_RESOLVER_MAX_LOCATORS)
-    set.locators.resize(KARST_RESOLVER_MAX_LOCATORS);
 }
 
 void Resolver::updateAnswer(Instance &instance) {
   const Node *node = instance.node;
-  Answer answer;
-  answer.state = KARST_RESOLVER_STATE_UNRESOLVED;
+  Answer answer{.state = KARST_RESOLVER_STATE_UNRESOLVED};
   if (node && instance.local && node->self) {
-    answer = {KARST_RESOLVER_STATE_RESOLVED,       node->uuid, node->major, node->minor, 0,
-              {{KARST_RESOLVER_LOCATOR_LOCAL, {}}}};
-  } else if (node && node->reachable && !node->set.locators.empty()) {
+    answer = {KARST_RESOLVER_STATE_RESOLVED, node->uuid, node->major, node->minor};
+    answer.add(KARST_RESOLVER_LOCATOR_LOCAL, nullptr);
+  } else if (node && node->reachable && node->set.count > 0) {
     answer = node->set;
     answer.state = KARST_RESOLVER_STATE_RESOLVED;
   }
-  instance.answers.push_back(std::move(answer));
+  instance.answers.push_back(answer);
 }
 
 /* ---- The world ------------------------------------------------------------------------------- */
@@ -333,7 +304,6 @@ void Resolver::installHealth(Inputs &inputs) {
     if (netIf->watched) continue;
     const Input made = inputs.take(Input::Subscribed, KARST_TYPE_HEALTH_STATUS, netIf->uuid);
     if (made.status != ZEL_OK) continue;
-    touchedNetIfs.add(*netIf);
     netIf->watched = true;
     followed[made.data] = netIf;
     ++netIf->references;
@@ -349,7 +319,6 @@ void Resolver::workOff(Inputs &inputs) {
     Node *node = dirty.front();
     dirty.pop_front();
     node->dirty = false;
-    touchedNodes.add(*node);
     generate(*node);
     if (node->instances.empty()) continue;
     ++node->references;
@@ -362,7 +331,6 @@ void Resolver::workOff(Inputs &inputs) {
 }
 
 void Resolver::worldSection(Inputs &inputs) {
-  if (refreshing) touchedNodes.add(*refreshing);
   switch (stage_) {
     case Stage::Cycle:
       installHealth(inputs);
@@ -434,10 +402,7 @@ void Resolver::destroy(Instance &instance) {
 
 void Resolver::learnSelf(Inputs &inputs) {
   self = inputs.take(Input::Self, 0, {}).header.uuid;
-  for (auto &[uuid, node] : nodes) {
-    touchedNodes.add(*node);
-    node->self = uuid == self;
-  }
+  for (auto &[uuid, node] : nodes) node->self = uuid == self;
 }
 
 void Resolver::forgetEntries() {

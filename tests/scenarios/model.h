@@ -37,14 +37,14 @@ struct Answer {
   uint32_t major = 0, minor = 0;
   uint64_t trafficType = 0;
   struct Locator {
-    uint32_t type;
-    std::array<uint8_t, 16> address; /* zeros behind the bytes that have a meaning */
-    static Locator of(uint32_t type, const uint8_t *address);
+    uint32_t type = 0;
+    std::array<uint8_t, 16> address{}; /* zeros behind the bytes that have a meaning */
     bool operator==(const Locator &) const = default;
   };
-  std::vector<Locator> locators;
+  size_t count = 0;
+  std::array<Locator, KARST_RESOLVER_MAX_LOCATORS> locators{};
 
-  bool is(uint32_t state, const KARSTResolverNodeLocators &set) const;
+  void add(uint32_t type, const uint8_t *address); /* as long as there is room */
   static Answer of(uint32_t state, const KARSTResolverNodeLocators &set);
   bool operator==(const Answer &) const = default;
   std::string text() const;
@@ -61,8 +61,6 @@ struct NetIf {
   bool watched = false;
   bool seen = false;
   unsigned references = 1;
-  bool touched = false;
-  const void *slot = nullptr; /* where the module keeps it, once somebody has seen it there */
 };
 
 struct Instance {
@@ -82,30 +80,6 @@ struct Node {
   std::vector<NetIf *> netIfs;
   std::vector<Instance *> instances;
   Answer set; /* its locators; the state is not used */
-  bool touched = false;
-  const void *slot = nullptr; /* as above */
-};
-
-/* What sections have named or changed, each once; what goes is no longer among them. */
-template <typename Element>
-class Touched {
- public:
-  void add(Element &element) {
-    if (!std::exchange(element.touched, true)) elements_.push_back(&element);
-  }
-  void remove(Element &element) {
-    if (element.touched) std::erase(elements_, &element);
-  }
-  void clear() {
-    for (Element *element : elements_) element->touched = false;
-    elements_.clear();
-  }
-  size_t size() const { return elements_.size(); }
-  auto begin() const { return elements_.begin(); }
-  auto end() const { return elements_.end(); }
-
- private:
-  std::vector<Element *> elements_;
 };
 
 /* What the module learnt while it worked: answers of the platform, in order. */
@@ -148,7 +122,6 @@ class Resolver {
 
   /* One critical section of the world, wherever it stands. */
   void worldSection(Inputs &inputs);
-  bool worldRefreshes() const { return stage_ != Stage::Cycle; }
   void worldEnds(); /* it may only do so between two cycles */
 
   void track(Instance &instance, const zel_UUID &uuid);
@@ -169,10 +142,6 @@ class Resolver {
   std::map<const void *, NetIf *> followed;        /* by a health subscription, to its last call */
   std::vector<Instance *> pending;                 /* that the world has moved aside, front first */
   Node *refreshing = nullptr;
-
-  /* Since they were cleared last. */
-  Touched<Node> touchedNodes;
-  Touched<NetIf> touchedNetIfs;
 
  private:
   enum class Stage { Cycle, Refresh, Resume };

@@ -1,6 +1,8 @@
 /* The host, its actors' operations and what must hold; see cluster.h. */
 #include "tests/scenarios/cluster.h"
 
+#include <fmt/format.h>
+
 #include <algorithm>
 #include <cstring>
 #include <utility>
@@ -20,41 +22,20 @@ namespace {
 
 constexpr uint32_t nudgeNode = 200; /* comes and goes to wake the world; no scenario uses it */
 constexpr uint32_t firstOfFlood = 1000;
-constexpr uint8_t canary = 0xa5;
 
 /* The host reports, and does not mind, what a heap or a lock domain still holds at its end. */
 void leftBehind(const std::string &report) {
   host::panic("left behind: %s", report.c_str());
 }
 
-/* Nothing is written behind the locators that are counted, and no more than there is room for. */
-void requireWithin(const KARSTResolverNodeLocators &set) {
-  bool within = set.count <= set.capacity;
-  for (size_t i = set.count; within && i < std::size(set.locators); i++)
-    within = set.locators[i].networkType == canary * 0x01010101u;
-  if (!within)
-    host::panic("a read writes behind the room that it has for %u locators", set.capacity);
-}
+/* A function of the module. */
+#define RESOLVER(name) module_->function<decltype(KARSTResolver_##name)>("KARSTResolver_" #name)
 
 }  // namespace
 
 std::string textOf(const sim::Operation &operation) {
-  static const char *const texts[] = {
-#define SCENARIO_TEXT(name, text) text,
-      SCENARIO_ACTIONS(SCENARIO_TEXT)
-#undef SCENARIO_TEXT
-  };
-  const std::string_view pattern = texts[operation.kind % actionCount];
-  const unsigned values[] = {operation.a, operation.b, operation.c};
-  std::string text;
-  for (size_t i = 0; i < pattern.size(); i++) {
-    if (pattern[i] == '$') {
-      text += std::to_string(values[pattern[++i] - '1']);
-    } else {
-      text += pattern[i];
-    }
-  }
-  return text;
+  const char *text = actionTexts[static_cast<size_t>(actionOf(operation))];
+  return fmt::format(fmt::runtime(text), operation.a, operation.b, operation.c);
 }
 
 /* ---- Life ------------------------------------------------------------------------------------ */
@@ -79,38 +60,29 @@ Cluster::~Cluster() {
 }
 
 void Cluster::load() {
-  if (module_ || loading_ || unloading_) return;
-  loading_ = true;
+  if (module_ || moving_) return;
+  moving_ = true;
   gone_.take();
   lockstep_.moduleComesOrGoes();
-  host::Module *module = nullptr;
   try {
-    module = &simulation_.modules().load(path_);
-  } catch (const host::ModuleError &) {
-    /* A platform call was made to fail; another load may succeed. */
-  }
-  loading_ = false;
-  if (!module) {
+    module_ = &simulation_.modules().load(path_);
+  } catch (const host::ModuleError &) { /* of a platform call; another load may succeed */
     if (simulation_.faultsInjected() == 0) host::panic("a load fails for no reason");
+  }
+  moving_ = false;
+  if (!module_) {
     gone_.give();
     return lockstep_.moduleIsGone();
   }
-  declareVariableGuards(simulation_, *module);
+  declareVariableGuards(simulation_, *module_);
   lockstep_.moduleIsThere();
-  functions_.create = module->function<decltype(KARSTResolver_Create)>("KARSTResolver_Create");
-  functions_.destroy = module->function<decltype(KARSTResolver_Destroy)>("KARSTResolver_Destroy");
-  functions_.setCallback =
-      module->function<decltype(KARSTResolver_SetCallback)>("KARSTResolver_SetCallback");
-  functions_.getNodeLocators =
-      module->function<decltype(KARSTResolver_GetNodeLocators)>("KARSTResolver_GetNodeLocators");
   loaded_.give();
-  module_ = module;
 }
 
 /* Clients make no new instances any more; those that they have, they destroy while it lasts. */
 void Cluster::unload() {
-  if (!module_ || unloading_) return;
-  unloading_ = true;
+  if (!module_ || moving_) return;
+  moving_ = true;
   while (creating_ > 0) simulation_.scheduler().sleep(1'000);
   simulation_.spawn("closing", [this] { destroyAll(); });
   loaded_.take();
@@ -124,7 +96,7 @@ void Cluster::unload() {
     host::panic("unloaded, and the directory still knows the module");
   requireTraces();
   module_ = nullptr;
-  unloading_ = false;
+  moving_ = false;
 }
 
 void Cluster::close() {
@@ -138,11 +110,12 @@ void Cluster::close() {
 
 void Cluster::perform(const sim::Operation &operation) {
   const auto [phase, actor, kind, a, b, c] = operation;
+  const Action action = actionOf(operation);
   host::Directory &directory = simulation_.directory();
   ++performed_;
   if (simulation_.keepsHistory())
     simulation_.note("operation:", sim::Argument::text(textOf(operation).c_str()));
-  switch (static_cast<Action>(kind % actionCount)) {
+  switch (action) {
     case Action::PutNode:
       return putNode(a, b);
     case Action::RemoveNode:
@@ -165,7 +138,7 @@ void Cluster::perform(const sim::Operation &operation) {
       return directory.resync();
     case Action::Usable:
     case Action::Unusable:
-      usable_ = static_cast<Action>(kind % actionCount) == Action::Usable;
+      usable_ = action == Action::Usable;
       return directory.setUsable(usable_);
     case Action::Interrupt:
       directory.setUsable(false);
@@ -178,11 +151,9 @@ void Cluster::perform(const sim::Operation &operation) {
     case Action::Create:
       return create(a, b, c);
     case Action::SetCallback:
-      if (Client *client = slot(a)) setCallback(*client, b);
-      return;
+      return setCallback(a, b);
     case Action::Read:
-      if (Client *client = slot(a)) read(*client, b);
-      return;
+      return read(a, b);
     case Action::Destroy:
       return destroy(a % clients);
     case Action::Load:
@@ -267,7 +238,7 @@ void Cluster::flood(uint32_t groups, uint32_t from, bool put) {
  * asks for the local locator. */
 void Cluster::create(uint8_t number, uint8_t target, uint8_t options) {
   const size_t place = number % clients;
-  if (slots_[place] || !module_ || unloading_) return;
+  if (slots_[place] || !module_ || moving_) return;
   const bool object = target >= 8;
   const zel_UUID objectWanted = object ? objectUUID(target % 8u) : noUUID;
   const zel_UUID nodeWanted =
@@ -283,7 +254,7 @@ void Cluster::create(uint8_t number, uint8_t target, uint8_t options) {
   client.users = 1;
   loaded_.take();
   const zel_Status status =
-      functions_.create(&client.instance, objectType, objectWanted, nodeWanted, local);
+      RESOLVER(Create)(&client.instance, objectType, objectWanted, nodeWanted, local);
   lockstep_.created(status, client.instance);
   client.made.give();
   used_.give();
@@ -313,8 +284,7 @@ void Cluster::callback(void *data, KARSTResolverInstance *instance, uint32_t sta
   client->cluster->told(*client, instance, state);
 }
 
-void Cluster::told(Client &client, KARSTResolverInstance *instance,
-                   uint32_t state) KARST_UNCHECKED {
+void Cluster::told(Client &client, KARSTResolverInstance *instance, uint32_t state) {
   sim::Fiber &fiber = simulation_.scheduler().running();
   const sim::Inside inside(fiber, sim::insideClientCallback);
   if (client.destroyed) host::panic("a callback of an instance whose destroy has returned");
@@ -332,39 +302,37 @@ void Cluster::told(Client &client, KARSTResolverInstance *instance,
   for (unsigned i = 0; i < client.work; i++) simulation_.scheduler().point();
 }
 
-void Cluster::setCallback(Client &client, uint8_t kind) {
-  if (!client.instance || client.users > 0) return; /* one at a time sets callbacks */
+void Cluster::setCallback(uint8_t number, uint8_t kind) {
+  Client *user = slots_[number % clients];
+  if (!user || !user->instance || user->users > 0) return; /* one at a time sets callbacks */
+  Client &client = *user;
   enter(client);
   const bool install = kind % 4 != 0;
   const uint64_t before = client.callbacks;
   ++callbackCalls_;
   client.work = kind % 4 == 3 ? callbackWork_ * 8 : callbackWork_;
-  functions_.setCallback(client.instance, install ? &callback : nullptr, &client);
+  RESOLVER(SetCallback)(client.instance, install ? &callback : nullptr, &client);
   if (install && client.callbacks == before) host::panic("a new callback was not called at once");
   client.hasCallback = install;
   leave(client);
 }
 
 /* Kind 3 has room for one locator only. */
-void Cluster::read(Client &client, uint8_t kind) {
-  if (!client.instance) return;
+void Cluster::read(uint8_t number, uint8_t kind) {
+  Client *user = slots_[number % clients];
+  if (!user || !user->instance) return;
+  Client &client = *user;
   enter(client);
-  KARSTResolverNodeLocators set;
-  std::memset(&set, canary, sizeof set);
+  KARSTResolverNodeLocators set{};
   set.capacity = kind % 4 == 3 ? 1 : KARST_RESOLVER_MAX_LOCATORS;
   const size_t from = client.model->answers.size() - 1;
-  const zel_Status status = functions_.getNodeLocators(client.instance, &set);
-  if (status == ZEL_OK) {
-    requireWithin(set);
-    if (set.capacity == KARST_RESOLVER_MAX_LOCATORS)
-      lockstep_.saw(*client.model, from, model::Answer::of(KARST_RESOLVER_STATE_RESOLVED, set));
-  } else {
-    if (status != ZEL_NOT_FOUND || reinterpret_cast<const uint8_t *>(&set)[0] != canary)
-      host::panic("a read that finds nothing returns 0x%x or writes", status);
-    model::Answer none;
-    none.state = KARST_RESOLVER_STATE_UNRESOLVED;
-    lockstep_.saw(*client.model, from, none);
-  }
+  const zel_Status status = RESOLVER(GetNodeLocators)(client.instance, &set);
+  if (status != ZEL_OK && status != ZEL_NOT_FOUND) host::panic("a read returns 0x%x", status);
+  if (set.count > set.capacity) host::panic("a read gives more than there is room for");
+  const auto state =
+      status == ZEL_OK ? KARST_RESOLVER_STATE_RESOLVED : KARST_RESOLVER_STATE_UNRESOLVED;
+  if (status != ZEL_OK || set.capacity == KARST_RESOLVER_MAX_LOCATORS)
+    lockstep_.saw(*client.model, from, model::Answer::of(state, set));
   leave(client);
 }
 
@@ -376,7 +344,7 @@ void Cluster::destroy(size_t place) {
   client->made.take();
   client->used.take();
   lockstep_.destroying(*client->model);
-  functions_.destroy(instance);
+  RESOLVER(Destroy)(instance);
   client->destroyed = true;
   lockstep_.destroyed();
   used_.give();
@@ -471,29 +439,25 @@ void Cluster::requireEnabled() {
 }
 
 /* The module holds what the directory says, where that fits. */
-std::vector<std::string> Cluster::differences() {
+void Cluster::requireDirectoryTaken() {
   const auto fits = [](size_t nodes, size_t netIfs) { return nodes <= 64 && netIfs <= 400; };
   const model::Resolver &resolver = lockstep_.resolver();
   const host::Directory &directory = simulation_.directory();
   if (!usable_ || !resolver.enabled || !fits(resolver.nodes.size(), resolver.netIfs.size()) ||
       !fits(directory.entries(KARST_TYPE_NODE).size(),
             directory.entries(KARST_TYPE_NET_INTERFACE).size()))
-    return {};
+    return;
   std::vector<HeldInstance> held;
   for (const Client *client : slots_) {
     if (!client) continue;
-    HeldInstance one{client->instance, std::nullopt};
+    HeldInstance &one = held.emplace_back(HeldInstance{client->instance, std::nullopt});
     if (client->hasCallback) one.told = client->model->answers[client->lastTold].state;
-    held.push_back(one);
   }
-  return differencesOf(lockstep_.cache(), directory, held, simulation_.settings().witness);
-}
-
-void Cluster::requireDirectoryTaken() {
-  std::string text;
-  for (const std::string &line : differences()) text += "\n  " + line;
-  if (text.empty()) return;
-  host::panic("the module and the directory differ:%s", text.c_str());
+  const std::vector<std::string> differences =
+      differencesOf(lockstep_.cache(), directory, held, simulation_.settings().witness);
+  if (!differences.empty())
+    host::panic("the module and the directory differ:\n  %s",
+                fmt::format("{}", fmt::join(differences, "\n  ")).c_str());
 }
 
 /* How often an event was traced. */

@@ -36,13 +36,6 @@ class Cluster {
   uint64_t performed() const { return performed_; }
 
  private:
-  struct Functions {
-    decltype(KARSTResolver_Create) *create = nullptr;
-    decltype(KARSTResolver_Destroy) *destroy = nullptr;
-    decltype(KARSTResolver_SetCallback) *setCallback = nullptr;
-    decltype(KARSTResolver_GetNodeLocators) *getNodeLocators = nullptr;
-  };
-
   /* An instance from its creation on; stays when it is destroyed. */
   struct Client {
     Cluster *cluster;
@@ -69,12 +62,11 @@ class Cluster {
 
   void load();
   void unload();
-  Client *slot(uint8_t number) { return slots_[number % clients]; }
   void create(uint8_t number, uint8_t target, uint8_t options);
   void enter(Client &client);
   void leave(Client &client);
-  void setCallback(Client &client, uint8_t kind);
-  void read(Client &client, uint8_t kind);
+  void setCallback(uint8_t number, uint8_t kind);
+  void read(uint8_t number, uint8_t kind);
   void destroy(size_t slot);
   void destroyAll();
 
@@ -83,7 +75,6 @@ class Cluster {
   void touchNews();
   void requireQuiet(); /* and that the model and clients hold what they should then */
   void requireEnabled();
-  std::vector<std::string> differences();
   void requireDirectoryTaken();
   void requireClientsTold();
   void requireTraces();
@@ -93,10 +84,8 @@ class Cluster {
   const std::filesystem::path path_;
   const unsigned callbackWork_;
   host::Module *module_ = nullptr;
-  Functions functions_{};
   sim::HandOver loaded_, used_, gone_; /* from load to clients, from these to unload, and on */
-  bool loading_ = false;
-  bool unloading_ = false;
+  bool moving_ = false;                /* it is loaded or unloaded */
   bool usable_ = false;
   uint64_t faultsSeen_ = 0; /* and recovered from */
   unsigned creating_ = 0;

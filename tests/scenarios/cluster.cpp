@@ -155,7 +155,7 @@ void Cluster::perform(const sim::Operation &operation) {
     case Action::Read:
       return read(a, b);
     case Action::Destroy:
-      return destroy(a % clients);
+      return destroy(a % places);
     case Action::Load:
       return load();
     case Action::Unload:
@@ -237,7 +237,7 @@ void Cluster::flood(uint32_t groups, uint32_t from, bool put) {
 /* Targets 0 to 7 are nodes, the others objects; of the options bit 0 gives an object a hint, bit 1
  * asks for the local locator. */
 void Cluster::create(uint8_t number, uint8_t target, uint8_t options) {
-  const size_t place = number % clients;
+  const size_t place = number % places;
   if (slots_[place] || !module_ || moving_) return;
   const bool object = target >= 8;
   const zel_UUID objectWanted = object ? objectUUID(target % 8u) : noUUID;
@@ -246,7 +246,7 @@ void Cluster::create(uint8_t number, uint8_t target, uint8_t options) {
   const bool local = (options & 2) != 0;
 
   ++creating_;
-  Client &client = *all_.emplace_back(std::make_unique<Client>());
+  Client &client = clients_.emplace_back();
   client.cluster = this;
   client.work = callbackWork_;
   client.model = &lockstep_.creating(objectWanted, nodeWanted, local);
@@ -268,9 +268,12 @@ void Cluster::create(uint8_t number, uint8_t target, uint8_t options) {
 }
 
 /* Around a call with an instance; as long as somebody is inside, nobody destroys it. */
-void Cluster::enter(Client &client) {
-  ++client.users;
-  client.made.take();
+Cluster::Client *Cluster::enter(uint8_t number, bool alone) {
+  Client *client = slots_[number % places];
+  if (!client || !client->instance || (alone && client->users > 0)) return nullptr;
+  ++client->users;
+  client->made.take();
+  return client;
 }
 
 void Cluster::leave(Client &client) {
@@ -280,60 +283,50 @@ void Cluster::leave(Client &client) {
 }
 
 void Cluster::callback(void *data, KARSTResolverInstance *instance, uint32_t state) {
-  auto *client = static_cast<Client *>(data);
-  client->cluster->told(*client, instance, state);
-}
-
-void Cluster::told(Client &client, KARSTResolverInstance *instance, uint32_t state) {
-  sim::Fiber &fiber = simulation_.scheduler().running();
+  Client &client = *static_cast<Client *>(data);
+  Cluster &cluster = *client.cluster;
+  sim::Fiber &fiber = cluster.simulation_.scheduler().running();
   const sim::Inside inside(fiber, sim::insideClientCallback);
   if (client.destroyed) host::panic("a callback of an instance whose destroy has returned");
   if (instance != client.instance) host::panic("a callback with somebody else's data");
   if (fiber.heldCount != 1 || std::strcmp(fiber.held[0]->name.text, "KARSTResolverInstance") != 0)
     host::panic("a callback with other locks than its instance's");
-  const model::Answer answer = model::Answer::of(state, instance->locators);
-  client.lastTold = lockstep_.saw(*client.model, client.lastTold, answer);
-  if (state == KARST_RESOLVER_STATE_RESOLVED && !client.model->local) {
-    if (answer.major < client.lastMajor) host::panic("an older version is told after a newer one");
-    client.lastMajor = answer.major;
-  }
+  client.lastTold = cluster.lockstep_.saw(*client.model, client.lastTold,
+                                          model::Answer::of(state, instance->locators));
   ++client.callbacks;
-  ++callbacks_;
-  for (unsigned i = 0; i < client.work; i++) simulation_.scheduler().point();
+  ++cluster.callbacks_;
+  for (unsigned i = 0; i < client.work; i++) cluster.simulation_.scheduler().point();
 }
 
+/* Kind 0 takes the callback away, kind 3 sets one that takes long. */
 void Cluster::setCallback(uint8_t number, uint8_t kind) {
-  Client *user = slots_[number % clients];
-  if (!user || !user->instance || user->users > 0) return; /* one at a time sets callbacks */
-  Client &client = *user;
-  enter(client);
-  const bool install = kind % 4 != 0;
-  const uint64_t before = client.callbacks;
+  Client *client = enter(number, true); /* one at a time sets callbacks */
+  if (!client) return;
+  const uint64_t before = client->callbacks;
   ++callbackCalls_;
-  client.work = kind % 4 == 3 ? callbackWork_ * 8 : callbackWork_;
-  RESOLVER(SetCallback)(client.instance, install ? &callback : nullptr, &client);
-  if (install && client.callbacks == before) host::panic("a new callback was not called at once");
-  client.hasCallback = install;
-  leave(client);
+  client->hasCallback = kind % 4 != 0;
+  client->work = kind % 4 == 3 ? callbackWork_ * 8 : callbackWork_;
+  RESOLVER(SetCallback)(client->instance, client->hasCallback ? &callback : nullptr, client);
+  if (client->hasCallback && client->callbacks == before)
+    host::panic("a new callback was not called at once");
+  leave(*client);
 }
 
 /* Kind 3 has room for one locator only. */
 void Cluster::read(uint8_t number, uint8_t kind) {
-  Client *user = slots_[number % clients];
-  if (!user || !user->instance) return;
-  Client &client = *user;
-  enter(client);
+  Client *client = enter(number, false);
+  if (!client) return;
   KARSTResolverNodeLocators set{};
   set.capacity = kind % 4 == 3 ? 1 : KARST_RESOLVER_MAX_LOCATORS;
-  const size_t from = client.model->answers.size() - 1;
-  const zel_Status status = RESOLVER(GetNodeLocators)(client.instance, &set);
+  const size_t from = client->model->answers.size() - 1;
+  const zel_Status status = RESOLVER(GetNodeLocators)(client->instance, &set);
   if (status != ZEL_OK && status != ZEL_NOT_FOUND) host::panic("a read returns 0x%x", status);
   if (set.count > set.capacity) host::panic("a read gives more than there is room for");
   const auto state =
       status == ZEL_OK ? KARST_RESOLVER_STATE_RESOLVED : KARST_RESOLVER_STATE_UNRESOLVED;
   if (status != ZEL_OK || set.capacity == KARST_RESOLVER_MAX_LOCATORS)
-    lockstep_.saw(*client.model, from, model::Answer::of(state, set));
-  leave(client);
+    lockstep_.saw(*client->model, from, model::Answer::of(state, set));
+  leave(*client);
 }
 
 void Cluster::destroy(size_t place) {
@@ -351,7 +344,7 @@ void Cluster::destroy(size_t place) {
 }
 
 void Cluster::destroyAll() {
-  for (size_t place = 0; place < clients; place++) {
+  for (size_t place = 0; place < places; place++) {
     while (slots_[place]) {
       destroy(place);
       if (slots_[place]) simulation_.scheduler().sleep(1'000);

@@ -3,7 +3,7 @@
  */
 #pragma once
 
-#include <memory>
+#include <deque>
 #include <vector>
 
 #include "karst_resolver/karst_resolver.h"
@@ -14,7 +14,7 @@
 
 class Cluster {
  public:
-  static constexpr size_t clients = 6;
+  static constexpr size_t places = 6; /* of clients */
 
   Cluster(const sim::Settings &settings, std::filesystem::path module, unsigned callbackWork);
   ~Cluster();
@@ -38,8 +38,8 @@ class Cluster {
  private:
   /* An instance from its creation on; stays when it is destroyed. */
   struct Client {
-    Cluster *cluster;
-    model::Instance *model;
+    Cluster *cluster = nullptr;
+    model::Instance *model = nullptr;
     KARSTResolverInstance *instance = nullptr;
     unsigned users = 0;       /* fibers inside a call with this instance */
     sim::HandOver made, used; /* from its maker to its users, and from these to its end */
@@ -47,12 +47,10 @@ class Cluster {
     bool hasCallback = false;
     uint64_t callbacks = 0;
     size_t lastTold = 0; /* in the model's answers */
-    uint32_t lastMajor = 0;
-    unsigned work = 0; /* scheduling points that a callback takes */
+    unsigned work = 0;   /* scheduling points that a callback takes */
   };
 
   static void callback(void *data, KARSTResolverInstance *instance, uint32_t state);
-  void told(Client &client, KARSTResolverInstance *instance, uint32_t state);
 
   void putNode(uint32_t node, uint32_t flags);
   void putNetIf(uint32_t netIf, uint32_t node, uint32_t record);
@@ -63,7 +61,7 @@ class Cluster {
   void load();
   void unload();
   void create(uint8_t number, uint8_t target, uint8_t options);
-  void enter(Client &client);
+  Client *enter(uint8_t number, bool alone); /* null: that makes no sense now */
   void leave(Client &client);
   void setCallback(uint8_t number, uint8_t kind);
   void read(uint8_t number, uint8_t kind);
@@ -89,8 +87,8 @@ class Cluster {
   bool usable_ = false;
   uint64_t faultsSeen_ = 0; /* and recovered from */
   unsigned creating_ = 0;
-  std::vector<std::unique_ptr<Client>> all_;
-  Client *slots_[clients] = {};
+  std::deque<Client> clients_; /* all that there ever were */
+  Client *slots_[places] = {};
   uint32_t stamp_ = 0; /* of what is put; versions only rise */
   uint64_t performed_ = 0;
   uint64_t callbacks_ = 0;

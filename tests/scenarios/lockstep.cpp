@@ -12,13 +12,9 @@
 #include "sim/access/access.h"
 #include "tests/scenarios/guards.h"
 
+using model::Input;
+
 namespace {
-
-constexpr const char *cacheLockName = "KARSTResolverCache";
-
-bool isCacheLock(const sim::Spinlock &lock) {
-  return std::strcmp(lock.name.text, cacheLockName) == 0;
-}
 
 /* By the name of its layout: the type of a record, and its size. */
 std::pair<uint8_t, size_t> kindOf(const std::string_view record) {
@@ -120,10 +116,12 @@ Lockstep::Activity &Lockstep::begin(Activity::Kind kind) {
 }
 
 /* A world begins by itself. */
-Lockstep::Activity *Lockstep::current() {
+Lockstep::Activity &Lockstep::current() {
   for (Activity &activity : activities_)
-    if (activity.fiber == fiber()) return &activity;
-  return simulation_.scheduler().running().world ? &begin(Activity::World) : nullptr;
+    if (activity.fiber == fiber()) return activity;
+  const sim::Fiber &running = simulation_.scheduler().running();
+  if (running.world) return begin(Activity::World);
+  host::panic("lockstep: %s is in the module for no reason that is known", running.name().c_str());
 }
 
 void Lockstep::end() {
@@ -136,9 +134,7 @@ void Lockstep::subscriptionCalls(sim::Fiber &, const sim::SubscriptionCall &call
                               : call.type == KARST_TYPE_HEALTH_STATUS ? Activity::Health
                                                                       : Activity::Object;
   Activity &activity = begin(kind);
-  activity.header = *call.header;
-  activity.status = call.status;
-  activity.data = call.data;
+  activity.call = call;
   const bool rescan = call.status == ZEL_SUB_RESYNC || call.status == ZEL_SUB_OVERFLOW;
   if (kind == Activity::Nodes && rescan) ++counts_.nodeRescans;
   if (kind == Activity::NetIfs && rescan) ++counts_.netIfRescans;
@@ -151,7 +147,7 @@ void Lockstep::subscriptionCalls(sim::Fiber &, const sim::SubscriptionCall &call
 }
 
 void Lockstep::subscriptionReturned(sim::Fiber &, const sim::SubscriptionCall &call) {
-  Activity &activity = *current();
+  Activity &activity = current();
   const bool cancelled = call.status == ZEL_SUB_CANCELLED;
   switch (activity.kind) {
     case Activity::Nodes:
@@ -173,7 +169,7 @@ void Lockstep::statusCalls(sim::Fiber &, uint32_t status) {
 }
 
 void Lockstep::statusReturned(sim::Fiber &, uint32_t) {
-  const Activity &activity = *current();
+  const Activity &activity = current();
   const bool enabling = activity.kind == Activity::Enable && !activity.failed;
   if (enabling ? activity.sections != 2 : activity.disabling == 1)
     host::panic("lockstep: a status call has ended half-way");
@@ -197,7 +193,7 @@ model::Instance &Lockstep::creating(const zel_UUID &object, const zel_UUID &node
 }
 
 void Lockstep::created(zel_Status status, KARSTResolverInstance *real) {
-  const Activity &activity = *current();
+  const Activity &activity = current();
   Known &made = known(*activity.instance);
   const bool good = status == ZEL_OK ? !made.destroyed && !activity.failed
                                      : made.destroyed || activity.sections == 0;
@@ -229,7 +225,7 @@ void Lockstep::destroying(model::Instance &instance) {
 }
 
 void Lockstep::destroyed() {
-  Activity &activity = *current();
+  Activity &activity = current();
   require(activity.sections, 1, "the number of sections in a destroy");
   ++counts_.destroys;
   std::erase(alive_, &known(*activity.instance));
@@ -239,63 +235,53 @@ void Lockstep::destroyed() {
 /* ---- What the platform answers --------------------------------------------------------------- */
 
 void Lockstep::lookedUp(sim::Fiber &, const sim::Lookup &lookup) {
-  Activity *activity = current();
-  if (!activity) return;
+  Activity &activity = current();
   const KarstEntryHeader header = lookup.header ? *lookup.header : KarstEntryHeader{};
-  if (activity->instance) { /* the object's entry */
-    model::Instance &instance = *activity->instance;
-    activity->found = lookup.status == ZEL_OK;
-    if (activity->found) {
-      want(*activity, header.owner);
-    } else {
-      want(*activity, instance.useHint ? instance.hint : zel_UUID{});
-    }
-    return;
+  if (const model::Instance *instance = activity.instance) { /* the object's entry */
+    activity.found = lookup.status == ZEL_OK;
+    const zel_UUID hint = instance->useHint ? instance->hint : zel_UUID{};
+    return want(activity, activity.found ? header.owner : hint);
   }
-  const auto kind =
-      lookup.call == sim::Call::KARST_FindEntry ? model::Input::Find : model::Input::FindWhole;
-  activity->inputs.add({kind, lookup.type, lookup.uuid, lookup.status, header, {}, nullptr});
+  const bool next = lookup.call == sim::Call::KARST_FindEntry;
+  activity.inputs.add({.kind = next ? Input::Find : Input::FindWhole,
+                       .type = lookup.type,
+                       .uuid = lookup.uuid,
+                       .status = lookup.status,
+                       .header = header});
 }
 
 void Lockstep::decoded(sim::Fiber &, const char *record, zel_Status status, const void *content) {
-  Activity *activity = current();
-  if (!activity) return;
   const auto [type, size] = kindOf(record);
   const auto *bytes = static_cast<const uint8_t *>(content);
-  activity->inputs.add(
-      {model::Input::Decoded, type, {}, status, {}, {bytes, bytes + size}, nullptr});
+  current().inputs.add(
+      {.kind = Input::Decoded, .type = type, .status = status, .record = {bytes, bytes + size}});
 }
 
 void Lockstep::toldSelf(sim::Fiber &, const zel_UUID &uuid) {
-  if (Activity *activity = current()) {
-    KarstEntryHeader header{};
-    header.uuid = uuid;
-    activity->inputs.add({model::Input::Self, 0, {}, ZEL_OK, header, {}, nullptr});
-  }
+  KarstEntryHeader header{};
+  header.uuid = uuid;
+  current().inputs.add({.kind = Input::Self, .header = header});
 }
 
 void Lockstep::subscribed(sim::Fiber &, const KarstQuery &query, void *data, zel_Status status) {
-  Activity *activity = current();
-  if (!activity) return;
-  switch (query.type) {
-    case KARST_TYPE_HEALTH_STATUS:
-      activity->inputs.add(
-          {model::Input::Subscribed, query.type, query.uuid, status, {}, {}, data});
-      return;
-    case KARST_TYPE_NODE:
-    case KARST_TYPE_NET_INTERFACE:
-      if (status == ZEL_OK) ++cacheSubscriptions_;
-      activity->failed |= status != ZEL_OK;
-      return;
-    default: /* the object's, in a create; calls may come from here on */
-      known(*activity->instance).real = static_cast<KARSTResolverInstance *>(data);
-      if (activity->found) activity->instance->useHint = false;
-      activity->failed |= status != ZEL_OK;
+  Activity &activity = current();
+  if (query.type == KARST_TYPE_HEALTH_STATUS)
+    return activity.inputs.add({.kind = Input::Subscribed,
+                                .type = query.type,
+                                .uuid = query.uuid,
+                                .status = status,
+                                .data = data});
+  activity.failed |= status != ZEL_OK;
+  if (query.type == KARST_TYPE_NODE || query.type == KARST_TYPE_NET_INTERFACE) {
+    cacheSubscriptions_ += status == ZEL_OK;
+  } else { /* the object's, in a create; calls may come from here on */
+    known(*activity.instance).real = static_cast<KARSTResolverInstance *>(data);
+    if (activity.found) activity.instance->useHint = false;
   }
 }
 
 void Lockstep::worldCreated(sim::Fiber &, zel_Status status) {
-  if (Activity *activity = current()) activity->failed |= status != ZEL_OK;
+  current().failed |= status != ZEL_OK;
 }
 
 void Lockstep::worldWaited(sim::Fiber &, zel_Status status) {
@@ -305,39 +291,36 @@ void Lockstep::worldWaited(sim::Fiber &, zel_Status status) {
 }
 
 void Lockstep::preemptionAnswered(sim::Fiber &, bool yes) {
-  if (Activity *activity = current())
-    activity->inputs.add({model::Input::Preemption, 0, {}, yes, {}, {}, nullptr});
+  current().inputs.add({.kind = Input::Preemption, .status = yes});
 }
 
 /* ---- Sections -------------------------------------------------------------------------------- */
 
-void Lockstep::locked(sim::Fiber &fiber, const sim::Spinlock &lock) {
-  if (isCacheLock(lock) && !current())
-    host::panic("lockstep: %s takes the cache lock for no reason that is known",
-                fiber.name().c_str());
-}
-
 void Lockstep::unlocking(sim::Fiber &fiber, const sim::Spinlock &lock) {
-  if (!isCacheLock(lock) || !cache_) return;
-  Activity &activity = *current();
+  if (std::strcmp(lock.name.text, "KARSTResolverCache") != 0 || !cache_) return;
+  Activity &activity = current();
   step(activity);
   ++activity.sections;
-  ++sections_;
   if (!activity.inputs.empty())
     host::panic("lockstep: %s asked for more than it needs", fiber.name().c_str());
   answersGrew();
   for (Activity &other : activities_) look(other);
-  compareSection();
+
+  /* Where every access is watched, everything is compared each time. Else after every eighth section,
+   * or later where much is held, so that this takes no longer than the sections themselves: a
+   * difference is found a little later, and many more sections are played. */
+  const size_t held = model_->nodes.size() + model_->netIfs.size();
+  if (sim::access::watching || ++sectionsSinceCompared_ >= std::max<size_t>(8, held / 4)) compare();
 }
 
 void Lockstep::step(Activity &activity) {
   switch (activity.kind) {
     case Activity::Nodes:
-      return model_->nodeCall(activity.header, activity.status, activity.inputs);
+      return model_->nodeCall(*activity.call.header, activity.call.status, activity.inputs);
     case Activity::NetIfs:
-      return model_->netIfCall(activity.header, activity.status, activity.inputs);
+      return model_->netIfCall(*activity.call.header, activity.call.status, activity.inputs);
     case Activity::Health:
-      return model_->healthCall(activity.data, activity.status, activity.inputs);
+      return model_->healthCall(activity.call.data, activity.call.status, activity.inputs);
     case Activity::World:
       return model_->worldSection(activity.inputs);
     case Activity::Enable:
@@ -383,11 +366,8 @@ void Lockstep::want(Activity &activity, const zel_UUID &node) {
 
 void Lockstep::look(Activity &activity) {
   if (!activity.instance || !activity.wanted || activity.tracked) return;
-  if (model::Resolver::tracksAlready(*activity.instance, *activity.wanted)) {
-    activity.mayStay = true;
-  } else {
-    activity.mayMove = true;
-  }
+  const bool stays = model::Resolver::tracksAlready(*activity.instance, *activity.wanted);
+  (stays ? activity.mayStay : activity.mayMove) = true;
 }
 
 void Lockstep::stepTracking(Activity &activity) {
@@ -448,14 +428,6 @@ void Lockstep::answersGrew() {
 }
 
 /* ---- Comparison ------------------------------------------------------------------------------ */
-
-/* Everything: after each section where every access is watched. Else after every eighth, or later
- * where much is held, so that this takes no longer than the sections themselves: a difference is
- * found a little later, and many more sections are played. */
-void Lockstep::compareSection() {
-  const size_t held = model_->nodes.size() + model_->netIfs.size();
-  if (sim::access::watching || ++sectionsSinceCompared_ >= std::max<size_t>(8, held / 4)) compare();
-}
 
 void Lockstep::compare() {
   ++checks_;

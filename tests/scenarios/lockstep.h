@@ -39,7 +39,6 @@ class Lockstep final : public sim::Observer {
   const model::Resolver &resolver() const { return *model_; }
   KARSTResolverCache *cache() const { return cache_; }
   uint64_t checks() const { return checks_; }
-  uint64_t sections() const { return sections_; }
 
   /* What the traces must add up to, from load to unload. */
   struct Counts {
@@ -48,7 +47,6 @@ class Lockstep final : public sim::Observer {
   const Counts &counts() const { return counts_; }
 
   /* ---- sim::Observer ------------------------------------------------------------------------- */
-  void locked(sim::Fiber &fiber, const sim::Spinlock &lock) override;
   void unlocking(sim::Fiber &fiber, const sim::Spinlock &lock) override;
   void lookedUp(sim::Fiber &fiber, const sim::Lookup &lookup) override;
   void decoded(sim::Fiber &fiber, const char *name, zel_Status status, const void *record) override;
@@ -69,9 +67,7 @@ class Lockstep final : public sim::Observer {
     uint32_t fiber = 0;
     enum Kind { Nodes, NetIfs, Health, Object, Enable, Disable, World, Create, Destroy };
     Kind kind = Nodes;
-    KarstEntryHeader header{};
-    zel_Status status = ZEL_OK;
-    const void *data = nullptr;
+    sim::SubscriptionCall call{};
     model::Instance *instance = nullptr;
     unsigned sections = 0; /* ended */
     model::Inputs inputs{};
@@ -94,7 +90,7 @@ class Lockstep final : public sim::Observer {
   /* Of the fiber that runs. */
   uint32_t fiber() const;
   Activity &begin(Activity::Kind kind);
-  Activity *current();
+  Activity &current();
   void end();
   void step(Activity &activity);
   void stepEnable(Activity &activity);
@@ -105,7 +101,6 @@ class Lockstep final : public sim::Observer {
   void objectReturned(Activity &activity);
   void answersGrew();
 
-  void compareSection();
   void compare();
   static void compareNode(const model::Node &node, const KARSTResolverNode &real);
   static void compareNetIf(const model::NetIf &netIf, const KARSTResolverNetIf &real);
@@ -121,7 +116,7 @@ class Lockstep final : public sim::Observer {
   std::deque<Known> instances_;      /* all that there ever were */
   std::vector<Known *> alive_;
   size_t cacheSubscriptions_ = 0; /* of nodes and interfaces, whose last call has not returned */
-  uint64_t checks_ = 0, sections_ = 0;
+  uint64_t checks_ = 0;
   size_t sectionsSinceCompared_ = 0;
   Counts counts_;
 };

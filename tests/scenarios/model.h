@@ -85,12 +85,12 @@ struct Node {
 /* What the module learnt while it worked: answers of the platform, in order. */
 struct Input {
   enum Kind { Find, FindWhole, Decoded, Subscribed, Preemption, Self } kind;
-  uint8_t type;      /* of the entry asked for; 0: by a header */
-  zel_UUID uuid;     /* asked for, or self */
-  zel_Status status; /* Preemption: 1 for yes */
-  KarstEntryHeader header;
-  std::vector<uint8_t> record;
-  const void *data; /* Subscribed */
+  uint8_t type = 0;           /* of the entry asked for; 0: by a header */
+  zel_UUID uuid{};            /* asked for */
+  zel_Status status = ZEL_OK; /* Preemption: 1 for yes */
+  KarstEntryHeader header{};  /* Self: its UUID */
+  std::vector<uint8_t> record{};
+  const void *data = nullptr; /* Subscribed */
 };
 
 class Inputs {

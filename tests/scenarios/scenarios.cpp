@@ -234,12 +234,12 @@ Operation drawn(sim::Random &random, Action action) {
     case Action::Drain:
       return doing(0, 0, action, among(random, 60, 20), among(random, 100));
     case Action::Create:
-      return doing(0, 0, action, among(random, Cluster::clients),
+      return doing(0, 0, action, among(random, Cluster::places),
                    random.below(2) == 0 ? node : among(random, 4, 8), among(random, 16));
     case Action::SetCallback:
     case Action::Read:
     case Action::Destroy:
-      return doing(0, 0, action, among(random, Cluster::clients), among(random, 4));
+      return doing(0, 0, action, among(random, Cluster::places), among(random, 4));
     case Action::Pause:
       return doing(0, 0, action, among(random, 4));
     case Action::Preempt:

@@ -34,7 +34,7 @@ void leftBehind(const std::string &report) {
 }  // namespace
 
 std::string textOf(const sim::Operation &operation) {
-  const char *text = actionTexts[static_cast<size_t>(actionOf(operation))];
+  const char *text = actionShapes[static_cast<size_t>(actionOf(operation))].text;
   return fmt::format(fmt::runtime(text), operation.a, operation.b, operation.c);
 }
 

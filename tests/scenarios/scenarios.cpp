@@ -193,60 +193,32 @@ constexpr sim::Call faultable[] = {sim::Call::zel_HeapAllocWithRA,
                                    sim::Call::zel_HeapCreate,
                                    sim::Call::KARST_RegisterStatusCallback};
 
-uint8_t among(sim::Random &random, size_t count, uint8_t from = 0) {
-  return static_cast<uint8_t>(from + random.below(count));
+uint8_t among(sim::Random &random, uint8_t from, uint8_t to) {
+  return static_cast<uint8_t>(from + random.below(to - from + size_t{1}));
 }
 
-Action chosen(sim::Random &random, const std::vector<Weight> &weights) {
-  unsigned total = 0;
-  for (const Weight &one : weights) total += one.weight;
-  size_t point = random.below(total);
-  for (const Weight &one : weights) {
-    if (point < one.weight) return one.action;
-    point -= one.weight;
-  }
-  return weights.back().action;
+/* One of them, as often as its weight says. */
+template <typename Weighted>
+size_t chosen(sim::Random &random, const std::vector<Weighted> &all) {
+  size_t total = 0;
+  for (const Weighted &one : all) total += one.weight;
+  size_t point = random.below(total), number = 0;
+  while (point >= all[number].weight) point -= all[number++].weight;
+  return number;
 }
 
+/* Most interfaces keep their owner and most are healthy; instances are of nodes or of objects. */
 Operation drawn(sim::Random &random, Action action) {
-  const uint8_t node = among(random, 4, 1), netIf = among(random, 5, 1);
-  switch (action) {
-    case Action::PutNode:
-      return doing(0, 0, action, node, among(random, 8));
-    case Action::PutNetIf:
-      /* Mostly below the same owner. */
-      return doing(0, 0, action, netIf,
-                   random.below(4) == 0 ? node : static_cast<uint8_t>(1 + netIf % 4),
-                   among(random, 256));
-    case Action::RemoveNetIf:
-    case Action::RemoveHealth:
-      return doing(0, 0, action, netIf);
-    case Action::PutHealth:
-      return doing(0, 0, action, netIf, random.below(3) == 0 ? among(random, 3) : uint8_t{0});
-    case Action::PutObject:
-      return doing(0, 0, action, among(random, 4), among(random, 5));
-    case Action::RemoveObject:
-      return doing(0, 0, action, among(random, 4));
-    case Action::Garble:
-      return doing(0, 0, action, netIf, among(random, 3));
-    case Action::Flood:
-      return doing(0, 0, action, among(random, 40, 8), among(random, 100));
-    case Action::Drain:
-      return doing(0, 0, action, among(random, 60, 20), among(random, 100));
-    case Action::Create:
-      return doing(0, 0, action, among(random, Cluster::places),
-                   random.below(2) == 0 ? node : among(random, 4, 8), among(random, 16));
-    case Action::SetCallback:
-    case Action::Read:
-    case Action::Destroy:
-      return doing(0, 0, action, among(random, Cluster::places), among(random, 4));
-    case Action::Pause:
-      return doing(0, 0, action, among(random, 4));
-    case Action::Preempt:
-      return doing(0, 0, action, among(random, 3, 1));
-    default:
-      return doing(0, 0, action, node);
-  }
+  const ActionShape &shape = actionShapes[static_cast<size_t>(action)];
+  Operation drawn = doing(0, 0, action, among(random, shape.from, shape.a));
+  drawn.b = among(random, 0, shape.b);
+  drawn.c = among(random, 0, shape.c);
+  if (action == Action::PutNetIf)
+    drawn.b = random.below(4) == 0 ? among(random, 1, 4) : 1 + drawn.a % 4;
+  if (action == Action::PutHealth && random.below(3) == 0) drawn.b = among(random, 0, 2);
+  if (action == Action::Create)
+    drawn.b = random.below(2) == 0 ? among(random, 1, 4) : among(random, 8, 11);
+  return drawn;
 }
 
 class Tabled final : public sim::Scenario {
@@ -285,13 +257,10 @@ Plan Tabled::plan(uint64_t seed, size_t length) const {
   plan.operations.push_back(doing(0, 0, Action::Load));
   if (!usableFirst) plan.operations.push_back(doing(0, 0, Action::Usable));
 
-  unsigned shares = 0;
-  for (const Actor &actor : profile_.actors) shares += actor.weight;
   for (size_t i = 0; i < length; i++) {
-    size_t point = random.below(shares);
-    uint8_t actor = 0;
-    while (point >= profile_.actors[actor].weight) point -= profile_.actors[actor++].weight;
-    Operation operation = drawn(random, chosen(random, profile_.actors[actor].actions));
+    const auto actor = static_cast<uint8_t>(chosen(random, profile_.actors));
+    const std::vector<Weight> &actions = profile_.actors[actor].actions;
+    Operation operation = drawn(random, actions[chosen(random, actions)].action);
     operation.actor = actor;
     operation.phase = static_cast<uint8_t>(1 + i * profile_.phases / length);
     plan.operations.push_back(operation);

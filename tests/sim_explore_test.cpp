@@ -90,29 +90,6 @@ void loseUpdate(Machine &machine, const sim::Plan &) {
   if (counter != 2) host::panic("an update was lost: %d", counter);
 }
 
-/* Bob must come between two steps of Ann's, and Ann again between two of his. */
-void needTwoPreemptions(Machine &machine, const sim::Plan &) {
-  bool open = false, seen = false, caught = false;
-  machine.spawn("ann", [&] {
-    for (int i = 0; i < 3; ++i) point();
-    open = true;
-    point();
-    open = false;
-    for (int i = 0; i < 3; ++i) point();
-    caught = seen;
-    for (int i = 0; i < 3; ++i) point();
-  });
-  machine.spawn("bob", [&] {
-    point();
-    if (open) seen = true;
-    point();
-    if (caught) host::panic("caught in between");
-    seen = false;
-    point();
-  });
-  machine.run();
-}
-
 /* Fails when the witness looks on in the middle of the third operation that does something, and in
  * another way when there are just two. */
 void needThree(Machine &machine, const sim::Plan &plan) {
@@ -143,12 +120,8 @@ void needThree(Machine &machine, const sim::Plan &plan) {
 
 /* Ann passes two points and Bob one. */
 void passPoints(Machine &machine, const sim::Plan &) {
-  machine.spawn("ann", [] {
-    point();
-    point();
-  });
+  machine.spawn("ann", [] { point(), point(); });
   machine.spawn("bob", [] { point(); });
-  machine.run();
 }
 
 /* Three wait for the same thing and are told one by one, in an order of free choice. */
@@ -180,7 +153,6 @@ void drift(Machine &machine, const sim::Plan &) {
     for (int i = 0; i < runs; ++i) point();
   });
   ++runs;
-  machine.run();
 }
 
 void goInCircles(Machine &machine, const sim::Plan &) {
@@ -188,16 +160,13 @@ void goInCircles(Machine &machine, const sim::Plan &) {
     for (volatile bool forever = true; forever;) {
     }
   });
-  machine.run();
 }
 
 void crash(Machine &machine, const sim::Plan &) {
   machine.spawn("ann", [] { raise(SIGSEGV); });
-  machine.run();
 }
 
 const Toy lostUpdate("lost-update", &loseUpdate);
-const Toy twoPreemptions("two-preemptions", &needTwoPreemptions);
 const Toy three("three", &needThree);
 const Toy points("points", &passPoints);
 const Toy telling("telling", &tellOneByOne);
@@ -227,10 +196,10 @@ TEST(Chance, FindsWhatItMustWithinSoManyRuns) {
   };
   const Expectation expectations[] = {
       {lostUpdate, "random", 50, "an update was lost: 1"},
+      {lostUpdate, "random:3", 200, "an update was lost: 1"},
       {lostUpdate, "pct:2", 100, "an update was lost: 1"},
-      {twoPreemptions, "random:3", 500, "caught in between"},
-      {twoPreemptions, "pct:3", 3000, "caught in between"},
       {three, "random", 200, "three operations, the last one halfway: 2"},
+      {three, "pct:3", 500, "three operations, the last one halfway: 2"},
   };
   for (const Expectation &expected : expectations) {
     SCOPED_TRACE(testing::Message() << expected.toy.name() << " " << expected.strategy);
@@ -257,35 +226,27 @@ TEST(Chance, PrioritiesWithoutAChangePreemptNobody) {
 /* Ann's three stretches and Bob's two: of the ten orders, 2 need no preemption, 3 one, 4 two, 1
  * three. */
 TEST(Exhaustive, PlaysEveryScheduleOnceWhoeverSharesTheWorkAndSaysWhatItHadNoBudgetFor) {
-  const struct {
-    unsigned jobs;
-    uint64_t runs;
-    double courses;
-    std::vector<std::pair<uint64_t, bool>> bounds; /* schedules of each, and whether all */
-  } rows[] = {
-      {1, UINT64_MAX, 10, {{2, true}, {5, true}, {9, true}, {10, true}, {10, true}}},
-      {2, UINT64_MAX, 10, {{2, true}, {5, true}, {9, true}, {10, true}, {10, true}}},
-      {3, UINT64_MAX, 10, {{2, true}, {5, true}, {9, true}, {10, true}, {10, true}}},
-      {1, 10, 6, {{2, true}, {5, true}, {3, false}}},
-  };
-  for (const auto &row : rows) {
-    Bench bench(row.jobs);
-    EXPECT_FALSE(bench.search.exhaust(points, 1, 4, {.runs = row.runs}));
-    std::vector<std::pair<uint64_t, bool>> bounds;
+  using Bounds = std::vector<std::pair<uint64_t, bool>>; /* schedules of each, and whether all */
+  const auto search = [](unsigned jobs, uint64_t runs) {
+    Bench bench(jobs);
+    EXPECT_FALSE(bench.search.exhaust(points, 1, 3, {.runs = runs}));
+    Bounds bounds;
     for (const sim::Exhausted &one : bench.search.exhausted())
       bounds.emplace_back(one.schedules, one.complete);
-    EXPECT_EQ(bounds, row.bounds) << row.jobs << " jobs";
-    EXPECT_NEAR(bench.search.figures().courses, row.courses, 0.1);
-  }
+    return bounds;
+  };
+  const Bounds all = {{2, true}, {5, true}, {9, true}, {10, true}};
+  for (const unsigned jobs : {1u, 2u, 3u}) EXPECT_EQ(search(jobs, UINT64_MAX), all) << jobs;
+  EXPECT_EQ(search(1, 10), (Bounds{{2, true}, {5, true}, {3, false}}));
 }
 
 TEST(Exhaustive, FindsAFaultAtItsBoundAndNotBelow) {
   Bench bench;
-  EXPECT_FALSE(bench.search.exhaust(twoPreemptions, 1, 1, {}));
-  const auto found = bench.search.exhaust(twoPreemptions, 1, 2, {});
+  EXPECT_FALSE(bench.search.exhaust(lostUpdate, 1, 0, {}));
+  const auto found = bench.search.exhaust(lostUpdate, 1, 1, {});
   ASSERT_TRUE(found);
-  EXPECT_EQ(found->failure.message, "caught in between");
-  EXPECT_EQ(found->failing.schedule->size(), 2u);
+  EXPECT_EQ(found->failure.message, "an update was lost: 1");
+  EXPECT_EQ(found->failing.schedule->size(), 1u);
   EXPECT_TRUE(bench.crew.alone([&] { sim::play(found->failing, {}); }));
 }
 
@@ -293,17 +254,15 @@ TEST(Exhaustive, FindsAFaultAtItsBoundAndNotBelow) {
 
 TEST(Replay, TakesTheSameCourseFromTheDeviationsAlone) {
   std::set<uint64_t> courses;
-  for (const char *strategy : {"default", "random", "random:5", "pct:3:20"}) {
-    for (uint64_t seed = 1; seed <= 20; ++seed) {
-      sim::ScheduleLog log;
-      sim::Case played = sim::makeCase(telling, seed, StrategyName::parse(strategy), 0);
-      const sim::Outcome first = sim::play(played, {}, &log);
-      played.schedule = log.schedule();
-      EXPECT_EQ(sim::play(played, {}).hash, first.hash) << strategy << ", seed " << seed;
-      courses.insert(first.hash);
-    }
+  for (uint64_t seed = 1; seed <= 40; ++seed) {
+    sim::ScheduleLog log;
+    sim::Case played = sim::makeCase(telling, seed, StrategyName::parse("random"), 0);
+    const sim::Outcome first = sim::play(played, {}, &log);
+    played.schedule = log.schedule();
+    EXPECT_EQ(sim::play(played, {}).hash, first.hash) << "seed " << seed;
+    courses.insert(first.hash);
   }
-  EXPECT_GT(courses.size(), 30u);
+  EXPECT_GT(courses.size(), 20u);
 }
 
 TEST(Text, ReadsBackWhatItWrites) {
@@ -313,19 +272,12 @@ TEST(Text, ReadsBackWhatItWrites) {
   EXPECT_EQ(sim::textOf(operations), "000102030405.fffe10000001");
   EXPECT_EQ(sim::textOf(faults), "KARST_FindEntry:3:4");
   EXPECT_EQ(sim::textOf(schedule), "3:1.4000000000:70000");
-  EXPECT_EQ(sim::operationsFrom(sim::textOf(operations)), operations);
-  EXPECT_EQ(sim::faultsFrom(sim::textOf(faults)), faults);
-  EXPECT_EQ(sim::scheduleFrom(sim::textOf(schedule)), schedule);
-  EXPECT_EQ(sim::textOf(Schedule{}), "-");
-  EXPECT_EQ(sim::scheduleFrom("-"), Schedule{});
-  for (const char *wrong : {"", "1", "1:2:3", "1:x", "1:2."})
-    EXPECT_THROW(sim::scheduleFrom(wrong), std::invalid_argument) << wrong;
-  EXPECT_THROW(sim::operationsFrom("00010203040"), std::invalid_argument);
-  EXPECT_THROW(sim::faultsFrom("nothing:1:1"), std::invalid_argument);
+  EXPECT_EQ(sim::operationsFrom("000102030405.fffe10000001"), operations);
+  EXPECT_EQ(sim::faultsFrom("KARST_FindEntry:3:4"), faults);
+  EXPECT_EQ(sim::scheduleFrom("3:1.4000000000:70000"), schedule);
+  EXPECT_EQ(sim::scheduleFrom(sim::textOf(Schedule{})), Schedule{});
   for (const char *name : {"default", "random", "random:7", "pct:3", "pct:4:1000", "exhaustive:0"})
     EXPECT_EQ(StrategyName::parse(name).toString(), name);
-  for (const char *wrong : {"", "walk", "random:0", "pct:0", "random:2:3", "pct:3:", "pct:-1"})
-    EXPECT_THROW(StrategyName::parse(wrong), std::invalid_argument) << wrong;
 }
 
 /* ---- Failures -------------------------------------------------------------------------------- */
@@ -418,10 +370,15 @@ TEST(Command, SaysWhatItDid) {
   EXPECT_THAT(command("--scenario points --strategy exhaustive:1 --runs 9 --jobs 1").text,
               HasSubstr("points, seed 1, at most 1 preemptions: 5 schedules, which are all"));
   EXPECT_THAT(command("--scenario points --schedule 0:2").text, HasSubstr("passes: "));
+  for (const std::string schedule : {"x", "1", "1:2:3", "1:x", "1:2."})
+    EXPECT_EQ(command("--scenario points --schedule " + schedule).status, 2) << schedule;
+  for (const std::string strategy : {"walk", "random:0", "pct:0", "random:2:3", "pct:3:", "pct:-1"})
+    EXPECT_EQ(command("--scenario points --strategy " + strategy).status, 2) << strategy;
   for (const char *wrong :
-       {"--scenario nothing", "--strategy walk", "--schedule 0:1", "--runs x",
-        "--scenario points --schedule x", "--scenario points --operations - --strategy pct:3",
-        "--watched --plain", "--regressions /no"})
+       {"--scenario nothing", "--schedule 0:1", "--runs x", "--scenario points --operations 0001",
+        "--scenario points --faults nothing:1:1",
+        "--scenario points --operations - --strategy pct:3", "--watched --plain",
+        "--regressions /no"})
     EXPECT_EQ(command(wrong).status, 2) << wrong;
 }
 

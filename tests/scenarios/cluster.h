@@ -92,7 +92,6 @@ class Cluster {
   uint32_t stamp_ = 0; /* of what is put; versions only rise */
   uint64_t performed_ = 0;
   uint64_t callbacks_ = 0;
-  uint64_t callbackCalls_ = 0; /* KARSTResolver_SetCallback */
   uint64_t traceSeen_ = 0;
   uint64_t traced_[32] = {}; /* by id */
   uint64_t freedInstances_ = 0;

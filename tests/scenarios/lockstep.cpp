@@ -135,9 +135,6 @@ void Lockstep::subscriptionCalls(sim::Fiber &, const sim::SubscriptionCall &call
                                                                       : Activity::Object;
   Activity &activity = begin(kind);
   activity.call = call;
-  const bool rescan = call.status == ZEL_SUB_RESYNC || call.status == ZEL_SUB_OVERFLOW;
-  if (kind == Activity::Nodes && rescan) ++counts_.nodeRescans;
-  if (kind == Activity::NetIfs && rescan) ++counts_.netIfRescans;
   if (kind != Activity::Object || call.status == ZEL_SUB_CANCELLED) return;
   activity.instance = &instanceOf(call.data);
   if (call.status == ZEL_OK) {
@@ -200,14 +197,9 @@ void Lockstep::created(zel_Status status, KARSTResolverInstance *real) {
   if (!good)
     host::panic("lockstep: create returned 0x%x after %u sections, destroyed %d", status,
                 activity.sections, made.destroyed);
-  if (activity.sections > 0) ++counts_.creates;
-  if (status == ZEL_OK) {
-    made.real = real;
-    requireResolved(made);
-  } else {
-    if (activity.sections > 0) ++counts_.destroys;
-    std::erase(alive_, &made);
-  }
+  made.real = real;
+  if (status == ZEL_OK) requireResolved(made);
+  if (status != ZEL_OK) std::erase(alive_, &made);
   end();
 }
 
@@ -227,7 +219,6 @@ void Lockstep::destroying(model::Instance &instance) {
 void Lockstep::destroyed() {
   Activity &activity = current();
   require(activity.sections, 1, "the number of sections in a destroy");
-  ++counts_.destroys;
   std::erase(alive_, &known(*activity.instance));
   end();
 }
@@ -416,7 +407,7 @@ void Lockstep::answersGrew() {
   for (Known *known : alive_) {
     const std::vector<model::Answer> &answers = known->answers;
     if (answers.size() == known->answersCounted) continue;
-    counts_.answers += answers.size() - known->answersCounted;
+    answers_ += answers.size() - known->answersCounted;
     known->answersCounted = answers.size();
     for (const model::Answer &one : known->expected)
       if (one != answers.back())
@@ -513,10 +504,5 @@ void Lockstep::atRest() {
   }
   require(cache_->refCount, cacheSubscriptions_ + model_->followed.size() + alive_.size(),
           "refCount of the cache");
-  const std::span slots(cache_->netIfPool, KARST_RESOLVER_NETIF_POOL_SIZE);
-  const auto inUse = std::count_if(slots.begin(), slots.end(), [](const auto &slot) {
-    return isTagged(slot, KARST_RESOLVER_TAG_NETIF);
-  });
-  require(static_cast<uint64_t>(inUse), model_->slots.size(), "the number of interfaces in slots");
   if (model_->enabled) require(model_->dirty.size(), 0, "the number of nodes that wait for work");
 }

@@ -40,11 +40,8 @@ class Lockstep final : public sim::Observer {
   KARSTResolverCache *cache() const { return cache_; }
   uint64_t checks() const { return checks_; }
 
-  /* What the traces must add up to, from load to unload. */
-  struct Counts {
-    uint64_t creates = 0, destroys = 0, answers = 0, nodeRescans = 0, netIfRescans = 0;
-  };
-  const Counts &counts() const { return counts_; }
+  size_t alive() const { return alive_.size(); } /* instances */
+  uint64_t answers() const { return answers_; }  /* that instances have had, but for the first */
 
   /* ---- sim::Observer ------------------------------------------------------------------------- */
   void unlocking(sim::Fiber &fiber, const sim::Spinlock &lock) override;
@@ -116,7 +113,6 @@ class Lockstep final : public sim::Observer {
   std::deque<Known> instances_;      /* all that there ever were */
   std::vector<Known *> alive_;
   size_t cacheSubscriptions_ = 0; /* of nodes and interfaces, whose last call has not returned */
-  uint64_t checks_ = 0;
+  uint64_t checks_ = 0, answers_ = 0;
   size_t sectionsSinceCompared_ = 0;
-  Counts counts_;
 };

@@ -1,12 +1,13 @@
 /* The sequential resolver; see model.h. */
 #include "tests/scenarios/model.h"
 
+#include <fmt/format.h>
+
 #include <algorithm>
 #include <cstring>
 #include <utility>
 
 #include "host/kernel/panic.h"
-#include "host/kernel/text.h"
 
 namespace model {
 
@@ -28,31 +29,30 @@ Answer Answer::of(uint32_t state, const KARSTResolverNodeLocators &set) {
 }
 
 std::string Answer::text() const {
-  std::string text = host::formatText("state %u, node %s, version %u.%u, traffic %llu,", state,
-                                      host::toString(node).c_str(), major, minor,
-                                      static_cast<unsigned long long>(trafficType));
-  for (size_t i = 0; i < count; i++) {
-    text += host::formatText(" %u:", locators[i].type);
-    for (const uint8_t byte : locators[i].address) text += host::formatText("%02x", byte);
-  }
+  std::string text = fmt::format("state {}, node {}, version {}.{}, traffic {},", state,
+                                 host::toString(node), major, minor, trafficType);
+  for (size_t i = 0; i < count; i++)
+    text += fmt::format(" {}:{:02x}", locators[i].type, fmt::join(locators[i].address, ""));
   return text;
 }
 
 /* ---- Inputs ---------------------------------------------------------------------------------- */
 
 Input Inputs::take(Input::Kind kind, uint8_t type, const zel_UUID &uuid) {
+  const auto question = [](int asked, int about, const zel_UUID &entry) {
+    return fmt::format("kind {}, type {}, {}", asked, about, host::toString(entry));
+  };
   if (empty())
-    host::panic("model: the module did not ask for kind %d, type %u, %s", kind, type,
-                host::toString(uuid).c_str());
+    host::panic("model: the module did not ask for %s", question(kind, type, uuid).c_str());
   Input input = std::move(queue_[taken_++]);
   if (empty()) {
     queue_.clear();
     taken_ = 0;
   }
   if (input.kind != kind || input.type != type || input.uuid != uuid)
-    host::panic("model: the module asked for kind %d, type %u, %s in place of kind %d, type %u, %s",
-                input.kind, input.type, host::toString(input.uuid).c_str(), kind, type,
-                host::toString(uuid).c_str());
+    host::panic("model: the module asked for %s in place of %s",
+                question(input.kind, input.type, input.uuid).c_str(),
+                question(kind, type, uuid).c_str());
   return input;
 }
 

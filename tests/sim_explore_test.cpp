@@ -20,7 +20,6 @@
 #include "sim/explore/case.h"
 #include "sim/explore/crew.h"
 #include "sim/explore/explore.h"
-#include "sim/explore/search.h"
 #include "sim/simulation.h"
 
 namespace {
@@ -166,97 +165,100 @@ void crash(Machine &machine, const sim::Plan &) {
   machine.spawn("ann", [] { raise(SIGSEGV); });
 }
 
-const Toy lostUpdate("lost-update", &loseUpdate);
-const Toy three("three", &needThree);
-const Toy points("points", &passPoints);
-const Toy telling("telling", &tellOneByOne);
+/* ---- The command ----------------------------------------------------------------------------- */
 
-/* ---- Search ---------------------------------------------------------------------------------- */
+struct Answer {
+  int status;
+  std::string text;
 
-/* A search of one toy by two children, in plans of twenty operations. */
-struct Bench {
-  explicit Bench(unsigned jobs = 2) : crew(jobs) {}
-  sim::Crew crew;
-  sim::Search search{crew, {}, 20, [] {}};
-
-  std::optional<sim::Found> byChance(const Toy &toy, const char *strategy, uint64_t runs) {
-    EXPECT_FALSE(search.measure({&toy}));
-    return search.byChance(
-        {.scenarios = {&toy}, .strategies = {StrategyName::parse(strategy)}, .seed = 1},
-        {.runs = runs});
+  /* The options that play again what was found. */
+  std::string again() const {
+    const std::string mark = "Again:   toys ";
+    const size_t begin = text.find(mark) + mark.size();
+    return text.substr(begin, text.find('\n', begin) - begin);
   }
 };
 
+Answer command(const std::string &options) {
+  std::vector<std::unique_ptr<sim::Scenario>> scenarios;
+  scenarios.push_back(std::make_unique<Toy>("lost-update", &loseUpdate));
+  scenarios.push_back(std::make_unique<Toy>("points", &passPoints));
+  scenarios.push_back(std::make_unique<Toy>("three", &needThree));
+  scenarios.push_back(std::make_unique<Toy>("drift", &drift));
+  std::vector<std::string> words = {"toys"};
+  std::istringstream stream(options);
+  for (std::string word; stream >> word;) words.push_back(word);
+  std::vector<char *> arguments;
+  for (std::string &word : words) arguments.push_back(word.data());
+  testing::internal::CaptureStdout();
+  testing::internal::CaptureStderr();
+  const int status =
+      sim::explore(static_cast<int>(arguments.size()), arguments.data(), scenarios,
+                   {.program = "toys", .watched = "watched.so", .plain = "plain.so"});
+  const std::string errors = testing::internal::GetCapturedStderr();
+  return {status, testing::internal::GetCapturedStdout() + errors};
+}
+
+/* By its seed and strategy, which are all that it depends on, each fails again. */
 TEST(Chance, FindsWhatItMustWithinSoManyRuns) {
-  struct Expectation {
-    const Toy &toy;
-    const char *strategy;
-    uint64_t runs;
-    const char *message;
+  const struct {
+    const char *options, *message;
+  } rows[] = {
+      {"--scenario lost-update --strategy random --runs 50", "an update was lost: 1"},
+      {"--scenario lost-update --strategy random:3 --runs 200", "an update was lost: 1"},
+      {"--scenario lost-update --strategy pct:2 --runs 100", "an update was lost: 1"},
+      {"--scenario three --strategy random --runs 200 --length 20",
+       "three operations, the last one halfway: 2"},
+      {"--scenario three --strategy pct:3 --runs 500 --length 20",
+       "three operations, the last one halfway: 2"},
   };
-  const Expectation expectations[] = {
-      {lostUpdate, "random", 50, "an update was lost: 1"},
-      {lostUpdate, "random:3", 200, "an update was lost: 1"},
-      {lostUpdate, "pct:2", 100, "an update was lost: 1"},
-      {three, "random", 200, "three operations, the last one halfway: 2"},
-      {three, "pct:3", 500, "three operations, the last one halfway: 2"},
-  };
-  for (const Expectation &expected : expectations) {
-    SCOPED_TRACE(testing::Message() << expected.toy.name() << " " << expected.strategy);
-    Bench bench;
-    const auto found = bench.byChance(expected.toy, expected.strategy, expected.runs);
-    ASSERT_TRUE(found);
-    EXPECT_EQ(found->failure.message, expected.message);
-    const auto again = bench.crew.alone([&] { sim::play(found->failing, {}); });
-    ASSERT_TRUE(again) << "its seed and strategy are all that it depends on";
-    EXPECT_EQ(again->message, expected.message);
+  for (const auto &[options, message] : rows) {
+    const Answer found = command(options + std::string(" --shorten-runs 0"));
+    EXPECT_EQ(found.status, 1) << options;
+    EXPECT_THAT(found.text, HasSubstr(std::string("Found: ") + message));
+    EXPECT_THAT(command(found.again()).text, HasSubstr(std::string("Found: ") + message));
   }
 }
 
 /* Two fibers without a change of priority follow each other whole. */
 TEST(Chance, PrioritiesWithoutAChangePreemptNobody) {
-  Bench bench;
-  EXPECT_FALSE(bench.byChance(lostUpdate, "pct:1", 200));
-  EXPECT_EQ(bench.search.figures().runs, 200u);
-  EXPECT_NEAR(bench.search.figures().courses, 2, 0.1);
+  const Answer found = command("--scenario lost-update --strategy pct:1 --runs 200");
+  EXPECT_EQ(found.status, 0);
+  EXPECT_THAT(found.text, testing::AllOf(HasSubstr("200 runs of 1 scenarios"),
+                                         HasSubstr("about 2 different ones")));
 }
-
-/* ---- All schedules --------------------------------------------------------------------------- */
 
 /* Ann's three stretches and Bob's two: of the ten orders, 2 need no preemption, 3 one, 4 two, 1
  * three. */
 TEST(Exhaustive, PlaysEveryScheduleOnceWhoeverSharesTheWorkAndSaysWhatItHadNoBudgetFor) {
-  using Bounds = std::vector<std::pair<uint64_t, bool>>; /* schedules of each, and whether all */
-  const auto search = [](unsigned jobs, uint64_t runs) {
-    Bench bench(jobs);
-    EXPECT_FALSE(bench.search.exhaust(points, 1, 3, {.runs = runs}));
-    Bounds bounds;
-    for (const sim::Exhausted &one : bench.search.exhausted())
-      bounds.emplace_back(one.schedules, one.complete);
-    return bounds;
-  };
-  const Bounds all = {{2, true}, {5, true}, {9, true}, {10, true}};
-  for (const unsigned jobs : {1u, 2u, 3u}) EXPECT_EQ(search(jobs, UINT64_MAX), all) << jobs;
-  EXPECT_EQ(search(1, 10), (Bounds{{2, true}, {5, true}, {3, false}}));
+  const std::string bounds =
+      "  points, seed 1, at most 0 preemptions: 2 schedules, which are all\n"
+      "  points, seed 1, at most 1 preemptions: 5 schedules, which are all\n"
+      "  points, seed 1, at most 2 preemptions: ";
+  for (const std::string jobs : {"1", "2", "3"})
+    EXPECT_THAT(command("--scenario points --strategy exhaustive:3 --jobs " + jobs).text,
+                HasSubstr(bounds + "9 schedules, which are all\n  points, seed 1, at most 3 "
+                                   "preemptions: 10 schedules, which are all\n"));
+  EXPECT_THAT(command("--scenario points --strategy exhaustive:3 --jobs 1 --runs 10").text,
+              HasSubstr(bounds + "3 schedules, not all\n"));
 }
 
 TEST(Exhaustive, FindsAFaultAtItsBoundAndNotBelow) {
-  Bench bench;
-  EXPECT_FALSE(bench.search.exhaust(lostUpdate, 1, 0, {}));
-  const auto found = bench.search.exhaust(lostUpdate, 1, 1, {});
-  ASSERT_TRUE(found);
-  EXPECT_EQ(found->failure.message, "an update was lost: 1");
-  EXPECT_EQ(found->failing.schedule->size(), 1u);
-  EXPECT_TRUE(bench.crew.alone([&] { sim::play(found->failing, {}); }));
+  EXPECT_EQ(command("--scenario lost-update --strategy exhaustive:0").status, 0);
+  const Answer found = command("--scenario lost-update --strategy exhaustive:1 --shorten-runs 0");
+  EXPECT_THAT(found.text, HasSubstr("Found: an update was lost: 1"));
+  EXPECT_THAT(found.again(), ContainsRegex("--schedule [0-9]+:[0-9]+$"));
+  EXPECT_EQ(command(found.again()).status, 1);
 }
 
 /* ---- One case -------------------------------------------------------------------------------- */
 
 TEST(Replay, TakesTheSameCourseFromTheDeviationsAlone) {
+  const Toy toy("telling", &tellOneByOne);
   std::set<uint64_t> courses;
   for (uint64_t seed = 1; seed <= 40; ++seed) {
     sim::ScheduleLog log;
-    sim::Case played = sim::makeCase(telling, seed, StrategyName::parse("random"), 0);
+    sim::Case played = sim::makeCase(toy, seed, StrategyName::parse("random"), 0);
     const sim::Outcome first = sim::play(played, {}, &log);
     played.schedule = log.schedule();
     EXPECT_EQ(sim::play(played, {}).hash, first.hash) << "seed " << seed;
@@ -301,39 +303,12 @@ TEST(Crew, ReportsWhatNeverEndsAndWhatCrashes) {
               "exception: no");
 }
 
-/* ---- The command ----------------------------------------------------------------------------- */
-
-struct Answer {
-  int status;
-  std::string text;
-};
-
-Answer command(const std::string &options) {
-  std::vector<std::unique_ptr<sim::Scenario>> scenarios;
-  scenarios.push_back(std::make_unique<Toy>("points", &passPoints));
-  scenarios.push_back(std::make_unique<Toy>("three", &needThree));
-  scenarios.push_back(std::make_unique<Toy>("drift", &drift));
-  std::vector<std::string> words = {"toys"};
-  std::istringstream stream(options);
-  for (std::string word; stream >> word;) words.push_back(word);
-  std::vector<char *> arguments;
-  for (std::string &word : words) arguments.push_back(word.data());
-  testing::internal::CaptureStdout();
-  testing::internal::CaptureStderr();
-  const int status =
-      sim::explore(static_cast<int>(arguments.size()), arguments.data(), scenarios,
-                   {.program = "toys", .watched = "watched.so", .plain = "plain.so"});
-  const std::string errors = testing::internal::GetCapturedStderr();
-  return {status, testing::internal::GetCapturedStdout() + errors};
-}
-
 /* The least that fails are three operations, no fault and one preemption. On the way there many plans
  * with two fail, in another way. */
 TEST(Command, FindsShortensAndRepeats) {
-  const std::string mark = "Again:   toys ";
-  const std::string least = mark +
-                            "--scenario three --seed [0-9]+ --operations "
-                            "000000010000.000000010000.000000010000 --schedule [0-9]+:[0-9]+\n";
+  const std::string least =
+      "--scenario three --seed [0-9]+ --operations 000000010000.000000010000.000000010000 "
+      "--schedule [0-9]+:[0-9]+$";
   std::string options;
   for (const std::string strategy : {"random", "pct:2"}) {
     const Answer found =
@@ -344,9 +319,9 @@ TEST(Command, FindsShortensAndRepeats) {
                 testing::AllOf(HasSubstr("Found: three operations, the last one halfway: "),
                                HasSubstr("phase 0   somebody         something\n"),
                                ContainsRegex("worker +zel_GetTimerCycles"),
-                               HasSubstr("* operation: something\n"), ContainsRegex(least)));
-    const size_t begin = found.text.find(mark) + mark.size();
-    options = found.text.substr(begin, found.text.find('\n', begin) - begin);
+                               HasSubstr("* operation: something\n")));
+    options = found.again();
+    EXPECT_THAT(options, ContainsRegex(least));
     EXPECT_EQ(command(options).status, 1) << options;
   }
   const std::string file = testing::TempDir() + "cases.txt";
@@ -361,14 +336,11 @@ TEST(Command, FindsShortensAndRepeats) {
 }
 
 TEST(Command, SaysWhatItDid) {
-  EXPECT_EQ(command("--scenario points --runs 100").status, 0);
   EXPECT_EQ(command("--scenario points --check-determinism 50").status, 0);
   const Answer drifting = command("--scenario drift --check-determinism 50 --jobs 1");
   EXPECT_EQ(drifting.status, 1);
   EXPECT_THAT(drifting.text, HasSubstr("two runs of one seed differ: 1 steps and 2, "));
   EXPECT_THAT(drifting.text, HasSubstr("--scenario drift --seed 1 --strategy random --runs 1"));
-  EXPECT_THAT(command("--scenario points --strategy exhaustive:1 --runs 9 --jobs 1").text,
-              HasSubstr("points, seed 1, at most 1 preemptions: 5 schedules, which are all"));
   EXPECT_THAT(command("--scenario points --schedule 0:2").text, HasSubstr("passes: "));
   for (const std::string schedule : {"x", "1", "1:2:3", "1:x", "1:2."})
     EXPECT_EQ(command("--scenario points --schedule " + schedule).status, 2) << schedule;

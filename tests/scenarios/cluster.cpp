@@ -23,11 +23,6 @@ namespace {
 constexpr uint32_t nudgeNode = 200; /* comes and goes to wake the world; no scenario uses it */
 constexpr uint32_t firstOfFlood = 1000;
 
-/* The host reports, and does not mind, what a heap or a lock domain still holds at its end. */
-void leftBehind(const std::string &report) {
-  host::panic("left behind: %s", report.c_str());
-}
-
 /* A function of the module. */
 #define RESOLVER(name) module_->function<decltype(KARSTResolver_##name)>("KARSTResolver_" #name)
 
@@ -45,11 +40,12 @@ Cluster::Cluster(const sim::Settings &settings, std::filesystem::path module, un
       lockstep_(simulation_),
       path_(std::move(module)),
       callbackWork_(callbackWork) {
-  host::setLogSink(
-      [](const host::LogLine &line) {
-        if (line.text.find("still") != std::string::npos) leftBehind(line.text);
-      },
-      true);
+  /* The host reports, and does not mind, what a heap or a lock domain still holds at its end. */
+  const auto sink = [](const host::LogLine &line) {
+    if (line.text.find("still") != std::string::npos)
+      host::panic("left behind: %s", line.text.c_str());
+  };
+  host::setLogSink(sink, true);
   simulation_.setObserver(&lockstep_);
   simulation_.directory().setSelf(nodeUUID(1));
 }
@@ -407,18 +403,14 @@ void Cluster::touchNews() {
 void Cluster::requireQuiet() {
   lockstep_.atRest();
   if (!module_) return;
-  requireClientsTold();
-  requireTraces();
-}
-
-void Cluster::requireClientsTold() {
   for (const Client *client : slots_) {
     if (!client || !client->hasCallback) continue;
-    if (client->model->answers[client->lastTold] != client->model->answers.back())
+    const std::vector<model::Answer> &answers = client->model->answers;
+    if (answers[client->lastTold] != answers.back())
       host::panic("a client was told \"%s\" last, and reads \"%s\"",
-                  client->model->answers[client->lastTold].text().c_str(),
-                  client->model->answers.back().text().c_str());
+                  answers[client->lastTold].text().c_str(), answers.back().text().c_str());
   }
+  requireTraces();
 }
 
 /* The module has heard of the last change of the directory's status. */

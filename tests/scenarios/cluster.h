@@ -74,7 +74,6 @@ class Cluster {
   void requireQuiet(); /* and that the model and clients hold what they should then */
   void requireEnabled();
   void requireDirectoryTaken();
-  void requireClientsTold();
   void requireTraces();
 
   sim::Simulation simulation_;

@@ -24,14 +24,10 @@ std::pair<uint8_t, size_t> kindOf(const std::string_view record) {
   return {KARST_TYPE_HEALTH_STATUS, sizeof(KarstHealthStatusEntry)};
 }
 
-std::string name(const zel_UUID &uuid) {
-  return host::toString(uuid);
-}
-
 void require(uint64_t real, uint64_t wanted, const char *what, const zel_UUID &whose = {}) {
   if (real == wanted) return;
   host::panic("lockstep: %s%s is %llu, and should be %llu", what,
-              host::isZero(whose) ? "" : (" of " + name(whose)).c_str(),
+              host::isZero(whose) ? "" : (" of " + host::toString(whose)).c_str(),
               static_cast<unsigned long long>(real), static_cast<unsigned long long>(wanted));
 }
 
@@ -39,7 +35,7 @@ void requireAnswer(const model::Answer &wanted, uint32_t state,
                    const KARSTResolverNodeLocators &set, const zel_UUID &node) {
   const model::Answer real = model::Answer::of(state, set);
   if (real != wanted)
-    host::panic("lockstep: %s answers \"%s\", and should \"%s\"", name(node).c_str(),
+    host::panic("lockstep: %s answers \"%s\", and should \"%s\"", host::toString(node).c_str(),
                 real.text().c_str(), wanted.text().c_str());
 }
 
@@ -67,8 +63,8 @@ void compareList(const Wanted &wanted, const KARSTResolverLink &head, size_t lin
 /* Where the order is all that counts. */
 const auto sameUUID = [](const auto &element, const auto &slot) {
   if (element.uuid != slot.uuid)
-    host::panic("lockstep: %s stands on a list where %s should", name(slot.uuid).c_str(),
-                name(element.uuid).c_str());
+    host::panic("lockstep: %s stands on a list where %s should", host::toString(slot.uuid).c_str(),
+                host::toString(element.uuid).c_str());
 };
 
 }  // namespace
@@ -430,7 +426,8 @@ void Lockstep::compare() {
     ++inUse;
     const auto found = model_->nodes.find(real.uuid);
     if (found == model_->nodes.end())
-      host::panic("lockstep: node %s is cached and should not be", name(real.uuid).c_str());
+      host::panic("lockstep: node %s is cached and should not be",
+                  host::toString(real.uuid).c_str());
     compareNode(*found->second, real);
   }
   require(inUse, model_->nodes.size(), "the number of nodes");
@@ -465,14 +462,14 @@ void Lockstep::compareNetIf(const model::NetIf &netIf, const KARSTResolverNetIf 
   sameUUID(netIf, real);
   const zel_UUID &uuid = netIf.uuid;
   if (!real.node || real.node->uuid != netIf.node->uuid)
-    host::panic("lockstep: interface %s has another owner", name(uuid).c_str());
+    host::panic("lockstep: interface %s has another owner", host::toString(uuid).c_str());
   require(real.refCount, netIf.references, "refCount", uuid);
   require(real.healthy, netIf.healthy, "healthy", uuid);
   require(real.healthSubInstalled, netIf.watched, "healthSubInstalled", uuid);
   require(real.rescanSeen, 0, "rescanSeen", uuid);
   require(real.health.healthFlags, netIf.health.healthFlags, "healthFlags", uuid);
   if (std::memcmp(&real.info, &netIf.info, sizeof real.info) != 0)
-    host::panic("lockstep: the record of interface %s differs", name(uuid).c_str());
+    host::panic("lockstep: the record of interface %s differs", host::toString(uuid).c_str());
 }
 
 void Lockstep::compareInstance(model::Instance &instance, KARSTResolverInstance &real) {

@@ -42,22 +42,25 @@ struct Profile {
 
 /* ---- Who does what --------------------------------------------------------------------------- */
 
-const std::vector<Weight> nodeEvents = {
-    {Action::PutNode, 4}, {Action::RemoveNode, 3}, {Action::Garble, 1}};
-const std::vector<Weight> netIfEvents = {{Action::PutNetIf, 6},
-                                         {Action::RemoveNetIf, 3},
-                                         {Action::PutHealth, 6},
-                                         {Action::RemoveHealth, 2},
-                                         {Action::Garble, 1}};
-const std::vector<Weight> objectEvents = {{Action::PutObject, 5}, {Action::RemoveObject, 3}};
-const std::vector<Weight> callers = {
+const std::vector<Weight> calls = {
     {Action::Create, 5}, {Action::SetCallback, 4}, {Action::Read, 3}, {Action::Destroy, 3}};
-const std::vector<Weight> readers = {{Action::Read, 1}};
-const std::vector<Weight> statusCalls = {
-    {Action::Usable, 3}, {Action::Unusable, 2}, {Action::Interrupt, 2}};
-const std::vector<Weight> disturbances = {
-    {Action::Resync, 1}, {Action::Preempt, 1}, {Action::Pause, 1}};
-const std::vector<Weight> loads = {{Action::Load, 2}, {Action::Unload, 2}, {Action::Pause, 1}};
+const Actor caller1{"caller-1", 4, calls}, caller2{"caller-2", 4, calls},
+    caller3{"caller-3", 4, calls}, reader{"reader", 3, {{Action::Read, 1}}};
+const Actor nodes{"nodes", 3, {{Action::PutNode, 4}, {Action::RemoveNode, 3}, {Action::Garble, 1}}};
+const Actor netIfs{"interfaces",
+                   4,
+                   {{Action::PutNetIf, 6},
+                    {Action::RemoveNetIf, 3},
+                    {Action::PutHealth, 6},
+                    {Action::RemoveHealth, 2},
+                    {Action::Garble, 1}}};
+const Actor objects{"objects", 3, {{Action::PutObject, 5}, {Action::RemoveObject, 3}}};
+const Actor floods{"floods", 3, {{Action::Flood, 4}, {Action::Drain, 3}, {Action::Resync, 1}}};
+const Actor status{
+    "status", 2, {{Action::Usable, 3}, {Action::Unusable, 2}, {Action::Interrupt, 2}}};
+const Actor trouble{"trouble", 1, {{Action::Resync, 1}, {Action::Preempt, 1}, {Action::Pause, 1}}};
+const Actor loader{"loader", 2, {{Action::Load, 2}, {Action::Unload, 2}, {Action::Pause, 1}}};
+const Actor rareLoader{"loader", 1, {{Action::Load, 1}}};
 
 Operation doing(uint8_t phase, uint8_t actor, Action action, uint8_t a = 0, uint8_t b = 0,
                 uint8_t c = 0) {
@@ -85,24 +88,19 @@ std::vector<Operation> smallScript(std::initializer_list<Operation> overlapping)
 
 /* ---- The table ------------------------------------------------------------------------------- */
 
-/* Phase 1 prepares, phase 2 is searched. */
-Profile smallProfile(const char *name, const char *about, std::vector<Operation> script) {
-  const Actor first{"first", 1, {}}, second{"second", 1, {}};
-  return {.name = name,
-          .about = about,
-          .actors = {first, second},
-          .preemption = false,
-          .script = std::move(script)};
-}
-
-/* Each has a window in its middle that was open once, or could be. */
+/* Each has a window in its middle that was open once, or could be. Phase 1 prepares, phase 2 is
+ * searched. */
 std::vector<Profile> smallProfiles() {
   const Operation makeForNode = doing(1, 0, Action::Create, 0, 2);
   const Operation makeForObject = doing(1, 0, Action::Create, 0, 10);
   const Operation listen = doing(1, 0, Action::SetCallback, 0, 1);
   std::vector<Profile> table;
   const auto add = [&](const char *name, const char *about, std::vector<Operation> script) {
-    table.push_back(smallProfile(name, about, std::move(script)));
+    table.push_back({.name = name,
+                     .about = about,
+                     .actors = {{"first", 1, {}}, {"second", 1, {}}},
+                     .preemption = false,
+                     .script = std::move(script)});
   };
   add("small-destroy", "an instance is destroyed while its node changes",
       smallScript({makeForNode, listen, doing(2, 0, Action::Destroy, 0),
@@ -132,47 +130,40 @@ std::vector<Profile> smallProfiles() {
 }
 
 std::vector<Profile> profiles() {
-  const Actor nodes{"nodes", 3, nodeEvents}, netIfs{"interfaces", 4, netIfEvents},
-      objects{"objects", 3, objectEvents}, one{"caller-1", 4, callers}, two{"caller-2", 4, callers},
-      reader{"reader", 3, readers}, status{"status", 2, statusCalls},
-      trouble{"trouble", 1, disturbances}, loader{"loader", 2, loads};
-  const Actor rareLoader{"loader", 1, {{Action::Load, 1}}};
-  const Actor floods{"floods", 3, {{Action::Flood, 4}, {Action::Drain, 3}, {Action::Resync, 1}}};
-
   std::vector<Profile> table;
   table.push_back({.name = "life",
                    .about = "loads and unloads while the directory's status changes",
-                   .actors = {nodes, netIfs, status, loader, one}});
+                   .actors = {nodes, netIfs, status, loader, caller1}});
   table.push_back({.name = "storms",
                    .about = "enables and disables that overlap with late last calls",
-                   .actors = {status, status, nodes, netIfs, one}});
+                   .actors = {status, status, nodes, netIfs, caller1}});
   table.push_back({.name = "events",
                    .about = "every kind of entry comes, changes, goes, and is lost in overflows",
-                   .actors = {nodes, netIfs, netIfs, objects, trouble, one},
+                   .actors = {nodes, netIfs, netIfs, objects, trouble, caller1},
                    .length = 600,
                    .queueBound = 2});
   table.push_back({.name = "crowd",
                    .about = "more nodes and interfaces than there are slots",
-                   .actors = {floods, netIfs, one, rareLoader},
+                   .actors = {floods, netIfs, caller1, rareLoader},
                    .length = 24,
                    .phases = 3,
                    .queueBound = 64,
                    .traceSlots = 1 << 15});
   table.push_back({.name = "churn",
                    .about = "instances come and go under callbacks that take long",
-                   .actors = {one, two, {"caller-3", 4, callers}, nodes, netIfs, trouble},
+                   .actors = {caller1, caller2, caller3, nodes, netIfs, trouble},
                    .length = 600,
                    .callbackWork = 12});
   table.push_back({.name = "moves",
                    .about = "objects change owners while their instances are refreshed",
-                   .actors = {objects, objects, netIfs, one, two},
+                   .actors = {objects, objects, netIfs, caller1, caller2},
                    .length = 480});
   table.push_back({.name = "readers",
                    .about = "several readers of the same instances, and writers",
-                   .actors = {reader, reader, {"reader-3", 3, readers}, netIfs, nodes, one}});
+                   .actors = {reader, reader, reader, netIfs, nodes, caller1}});
   table.push_back({.name = "faults",
                    .about = "platform calls fail at any moment, and everything else goes on",
-                   .actors = {nodes, netIfs, objects, status, loader, one, two, trouble},
+                   .actors = {nodes, netIfs, objects, status, loader, caller1, caller2, trouble},
                    .faults = 6});
 
   for (Profile &small : smallProfiles()) table.push_back(std::move(small));

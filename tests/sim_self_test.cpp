@@ -1,6 +1,6 @@
 /* The simulator's own promises that no search would miss: what must not happen is reported with
- * names; time, held fibers and worlds do what was asked. The machine is driven directly, without a
- * module.
+ * names; time, held fibers, worlds and failures do what was asked. The machine is driven directly,
+ * without a module.
  */
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -223,6 +223,21 @@ TEST(World, WaitsNoLongerThanItsTimeOutAndNeverGivesWayTwiceRunning) {
   machine.run();
   EXPECT_EQ(answers, "ynynynnn");
   machine.call("stopper", [&] { worker.stop(); });
+}
+
+/* ---- Failures on demand ---------------------------------------------------------------------- */
+
+TEST(Faults, ComeAtExactlyTheUsesAsked) {
+  Machine machine;
+  SimHeap heap;
+  machine.failAt(sim::Call::zel_HeapAllocWithRA, 2, 2);
+  std::string got;
+  for (int i = 0; i < 5; ++i) {
+    uint64_t *block = heap.get(8);
+    got += block ? '+' : '-';
+    heap.put(block);
+  }
+  EXPECT_EQ(got, "+--++");
 }
 
 }  // namespace

@@ -39,12 +39,6 @@ void requireAnswer(const model::Answer &wanted, uint32_t state,
                 real.text().c_str(), wanted.text().c_str());
 }
 
-/* In use, by its tag. */
-template <typename Slot>
-bool isTagged(const Slot &slot, const char *tag) {
-  return std::memcmp(slot.tag, tag, sizeof slot.tag) == 0;
-}
-
 /* Each on a list beside the one that it should be. `links`: where an element has its own. */
 template <typename Real, typename Wanted, typename Compare>
 void compareList(const Wanted &wanted, const KARSTResolverLink &head, size_t links,
@@ -422,7 +416,7 @@ void Lockstep::compare() {
   require(cache_->enabled, model_->enabled, "enabled");
   size_t inUse = 0;
   for (const KARSTResolverNode &real : std::span(cache_->nodePool, KARST_RESOLVER_NODE_POOL_SIZE)) {
-    if (!isTagged(real, KARST_RESOLVER_TAG_NODE)) continue;
+    if (std::memcmp(real.tag, KARST_RESOLVER_TAG_NODE, sizeof real.tag) != 0) continue; /* free */
     ++inUse;
     const auto found = model_->nodes.find(real.uuid);
     if (found == model_->nodes.end())

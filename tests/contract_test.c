@@ -1,8 +1,8 @@
 /*
  * Can somebody who has only the binary contract host the module? A host kernel in one file that shares
- * no line with the module or with its hosts: every record, offset, number and text is typed again. In
- * it a load fails, and another one lives a whole life. One thread: the module's world is run up to its
- * wait, and stopped there.
+ * no line with the module or with its hosts: every record, offset, number and text is typed again.
+ * The module lives one whole life in it. One thread: its world is run up to its wait, and stopped
+ * there.
  */
 #define _GNU_SOURCE
 #include <dlfcn.h>
@@ -14,7 +14,6 @@
 #include <string.h>
 
 enum { OK = 0, NOT_FOUND = 0x0bad0003, SUB_CANCELLED = 0x0bad0030, WORLD_STOPPING = 0x0bad0069 };
-enum { REFUSED = 0x0bad0777 /* a status that only this host knows */ };
 enum { NODE = 3, NETIF = 6, HEALTH = 7, OBJECT = 9 };
 enum { MODULE_ID = 0x4b52, HEAP_ID = 0x7ea9, DOMAIN_ID = 0x10c4, LOG_LEVEL = 5, WORLD_ID = 71 };
 
@@ -25,21 +24,14 @@ typedef uint32_t (*SubFn)(void *data, const void *header, void *arg, uint32_t st
 typedef void (*StatusFn)(void *data, uint32_t status);
 typedef void (*ClientFn)(void *data, void *instance, uint32_t state);
 
-static int failures;
-
-static void judge(bool good, int line, const char *what) {
-  if (good) return;
-  failures++;
-  fprintf(stderr, "line %d: %s does not hold\n", line, what);
+static _Noreturn void give_up(int line, const char *why) {
+  fprintf(stderr, "line %d: %s\n", line, why);
+  abort();
 }
-#define CHECK(condition) judge((condition), __LINE__, #condition)
+#define CHECK(condition) ((condition) ? (void)0 : give_up(__LINE__, "not so: " #condition))
 #define CHECK_TEXT(actual, expected) CHECK(strcmp((actual), (expected)) == 0)
 #define CHECK_BYTES(actual, expected, size) CHECK(memcmp((actual), (expected), (size)) == 0)
 
-static _Noreturn void give_up(const char *why) {
-  fprintf(stderr, "%s\n", why);
-  abort();
-}
 static uint64_t number_at(const void *base, size_t offset, size_t width) {
   uint64_t value = 0;
   memcpy(&value, (const uint8_t *)base + offset, width);
@@ -59,15 +51,15 @@ static int alive; /* heap, domain, log, world, blocks, locks, subscriptions, the
 
 /* clang-format off */
 #define ALWAYS(type, name, parameters, answer) type name parameters { return answer; }
-ALWAYS(const char *, zel_LogGetName, (void *log), log == &log_object ? "KARSTResolver log" : "")
-ALWAYS(int32_t, zel_LogGetCurrentLogLevel, (void *log), log == &log_object ? LOG_LEVEL : -1)
-ALWAYS(const char *, zel_StatusToString, (uint32_t status), status == REFUSED ? "REFUSED" : "?")
+ALWAYS(const char *, zel_LogGetName, (void), "KARSTResolver")
+ALWAYS(int32_t, zel_LogGetCurrentLogLevel, (void), LOG_LEVEL)
+ALWAYS(const char *, zel_StatusToString, (void), "?")
 ALWAYS(uint32_t, zel_SpinlockAllocSize, (uint32_t type), type == 1 ? 64 : 0)
 ALWAYS(uint32_t, tolmapi_HeapRequest2Size, (uint32_t bytes), bytes + 56)
 ALWAYS(uint32_t, QXT_GetMaxAssocCount, (void), 0x20000)
 ALWAYS(uint64_t, tolmapi_GetReturnAddress, (uint32_t frame), 0x1000 + frame)
 ALWAYS(int32_t, Trace_ClassLevelGet, (uint32_t class), class >= 35 && class <= 37 ? 2 : -1)
-ALWAYS(uint64_t, TokenBucket_TimeToGetTokens, (void *bucket), (uintptr_t)bucket)
+ALWAYS(uint64_t, TokenBucket_TimeToGetTokens, (void), 0)
 ALWAYS(uint32_t, Trace_GetPerTraceThrottledTraceId, (void), 901)
 ALWAYS(uint32_t, Trace_GetGlobalThrottledTraceId, (void), 902)
 ALWAYS(uint32_t, tolmapi_GetPCPUNumPreemptible, (void), 0x1da)
@@ -75,10 +67,10 @@ ALWAYS(uint64_t, zel_GetTimerCycles, (void), 1000)
 ALWAYS(uint64_t, zel_TimerTCToNS, (uint64_t cycles), cycles * 3 + 7)
 ALWAYS(bool, tolmapi_PreemptionIsPending, (void), false)
 ALWAYS(bool, TOLM_IsWitnessNode, (void), false)
-ALWAYS(uint32_t, ExprMsh_MshNetInterfaceEntry, (void), REFUSED)
-ALWAYS(uint32_t, ExprMsh_UmshNetInterfaceEntry, (void), REFUSED)
-ALWAYS(uint32_t, ExprMsh_MshNetInterfaceEntryIpAddresses, (void), REFUSED)
-ALWAYS(uint32_t, ExprMsh_UmshNetInterfaceEntryIpAddresses, (void), REFUSED)
+ALWAYS(uint32_t, ExprMsh_MshNetInterfaceEntry, (void), NOT_FOUND)
+ALWAYS(uint32_t, ExprMsh_UmshNetInterfaceEntry, (void), NOT_FOUND)
+ALWAYS(uint32_t, ExprMsh_MshNetInterfaceEntryIpAddresses, (void), NOT_FOUND)
+ALWAYS(uint32_t, ExprMsh_UmshNetInterfaceEntryIpAddresses, (void), NOT_FOUND)
 /* clang-format on */
 
 /* ---- Heap, locks ------------------------------------------------------------------------------- */
@@ -110,7 +102,6 @@ void *zel_HeapAllocWithRA(uint64_t heap, uint32_t size, void *asker) {
 }
 void zel_HeapFree(uint64_t heap, void *block) {
   CHECK(heap == HEAP_ID);
-  if (block == cache) CHECK_BYTES(block, "\x94\x9e\x8d\x8c\x8b\x8d\x9c\xff", 8);
   alive--;
   free(block);
 }
@@ -125,9 +116,7 @@ void zel_LockDomainDestroy(uint64_t domain) {
   CHECK(domain == DOMAIN_ID);
   alive--;
 }
-static uint32_t next_lock_status = OK;
-static uint64_t held; /* a lock's handle is its rank, 1 or 2: no two instances live at once */
-
+/* A lock's handle is its rank. */
 uint32_t zel_SpinlockCreate(const void *props, uint64_t *lock) {
   const struct {
     uint32_t module;
@@ -139,7 +128,6 @@ uint32_t zel_SpinlockCreate(const void *props, uint64_t *lock) {
   } *p = props;
   CHECK(p->module == MODULE_ID && p->heap == HEAP_ID && p->type == 1 && p->domain == DOMAIN_ID);
   CHECK_TEXT(p->name, p->rank == 1 ? "KARSTResolverCache" : "KARSTResolverInstance");
-  if (next_lock_status != OK) return next_lock_status;
   *lock = p->rank;
   alive++;
   return OK;
@@ -149,17 +137,13 @@ void zel_SpinlockDestroy(uint64_t lock) {
   alive--;
 }
 void zel_SpinlockLock(uint64_t lock) {
-  CHECK(lock > held);
-  held += lock;
+  CHECK(lock == 1 || lock == 2);
 }
 void zel_SpinlockUnlock(uint64_t lock) {
-  CHECK((held & lock) != 0);
-  held -= lock;
+  CHECK(lock == 1 || lock == 2);
 }
 
 /* ---- Log, text, panic -------------------------------------------------------------------------- */
-
-static char last_line[256];
 
 uint32_t Tolm_LogInit(const char *name, uint32_t module, uint32_t two, uint32_t zero, void **log) {
   CHECK(module == MODULE_ID && two == 2 && zero == 0);
@@ -173,15 +157,10 @@ void Tolm_LogCleanup(void **log) {
   alive--;
 }
 void zel_LogLevel(uint32_t urgency, void *log, int32_t level, const char *format, ...) {
-  va_list args;
-  va_start(args, format);
-  CHECK(urgency == 2 && log == &log_object && level == LOG_LEVEL);
-  vsnprintf(last_line, sizeof last_line, format, args);
-  va_end(args);
+  CHECK(urgency == 2 && log == &log_object && level == LOG_LEVEL && format != NULL);
 }
 void zel_LogNoLevel(uint32_t urgency, const char *format, ...) {
-  CHECK(urgency == 0);
-  snprintf(last_line, sizeof last_line, "%s", format);
+  CHECK(urgency == 0 && format != NULL);
 }
 int zel_Snprintf(char *buffer, size_t size, const char *format, ...) {
   va_list args;
@@ -191,8 +170,8 @@ int zel_Snprintf(char *buffer, size_t size, const char *format, ...) {
   return length;
 }
 void zel_PanicWithModuleID(uint32_t module, const char *format, ...) {
-  fprintf(stderr, "panic of module 0x%x: ", module);
-  give_up(format);
+  CHECK(module == MODULE_ID);
+  give_up(0, format);
 }
 
 /* ---- Tracing ----------------------------------------------------------------------------------- */
@@ -212,12 +191,11 @@ void *traceStreamTables[] = {NULL, &stream, NULL};
 const unsigned char perTraceTbConfig[] = {1, 2, 3, 4};
 
 void TokenBucket_InitMini(void *bucket, const void *config) {
-  CHECK(config == perTraceTbConfig);
-  memset(bucket, 0x77, 8);
+  CHECK(bucket != NULL && config == perTraceTbConfig);
 }
 bool TokenBucket_UseTokensMini(void *bucket, const void *config, uint64_t tokens, uint64_t *left) {
-  CHECK(config == perTraceTbConfig && tokens == 1 && all_bytes(bucket, 8, 0x77));
-  *left = 1;
+  CHECK(bucket != NULL && config == perTraceTbConfig && tokens == 1);
+  *left = 1; /* none would make a notice of the event */
   return true;
 }
 bool TokenBucket_UseTokens(void *bucket, uint64_t tokens, uint64_t *left) {
@@ -258,7 +236,7 @@ void tolmapi_PreemptionEnable(void) {
   world.preemptible = true;
 }
 uint32_t zel_WorldWait(uint64_t event, uint64_t lock, uint32_t timeout, const char *reason) {
-  CHECK(event == 0 && lock == UINT64_MAX && timeout == UINT32_MAX && held == 0);
+  CHECK(event == 0 && lock == UINT64_MAX && timeout == UINT32_MAX);
   CHECK_TEXT(reason, "KARSTResolverCacheWorld");
   return WORLD_STOPPING;
 }
@@ -294,7 +272,6 @@ static struct sub {
   void *data;
   bool ended;
 } subs[SUBS];
-static char subscribed[64]; /* "+3": to entries of this type, "-3": no longer */
 static StatusFn status_fn;
 static const Uuid nobody, self_uuid = {{7, 7, 7}};
 
@@ -305,8 +282,7 @@ uint32_t KARST_RegisterStatusCallback(StatusFn fn, void *data) {
   return OK;
 }
 void KARST_DeregisterStatusCallback(StatusFn fn, void *data) {
-  if (fn != status_fn || data != cache) return; /* never registered, after a load that failed */
-  status_fn = NULL;
+  CHECK(fn == status_fn && data == cache);
   alive--;
 }
 void KARST_GetSelfUUID(void *uuid) {
@@ -325,8 +301,7 @@ static struct entry *entry_for(const struct query *q) {
 uint32_t KARST_Subscribe(const void *query, SubFn fn, void *data) {
   const struct query *q = query;
   struct sub *s = subs;
-  CHECK(held <= 1 && q->flags == (all_bytes(&q->uuid, 16, 0) ? 0x0b : 0x09));
-  sprintf(subscribed + strlen(subscribed), "+%d", q->type);
+  CHECK(q->flags == (all_bytes(&q->uuid, 16, 0) ? 0x0b : 0x09));
   while (s->fn != NULL) s++;
   *s = (struct sub){query, fn, data, false};
   alive++;
@@ -334,7 +309,6 @@ uint32_t KARST_Subscribe(const void *query, SubFn fn, void *data) {
 }
 void KARST_Unsubscribe(const void *query, SubFn fn, void *data) {
   struct sub *s = subs;
-  sprintf(subscribed + strlen(subscribed), "-%d", ((const struct query *)query)->type);
   while (s->query != query || s->fn != fn || s->data != data) s++;
   s->ended = true;
 }
@@ -391,7 +365,7 @@ static void tell(uint8_t type, Uuid uuid, Uuid owner, const void *data, uint32_t
 }
 /* Cancelled subscriptions get their last call while the module waits for it. */
 void zel_WorldSleep(uint32_t microseconds) {
-  CHECK(microseconds == 100000 && held == 0);
+  CHECK(microseconds == 100000);
   for (int i = 0; i < SUBS; i++) {
     const struct sub s = subs[i];
     if (!s.ended) continue;
@@ -416,7 +390,7 @@ static const Uuid object = {{48, 49, 50, 51, 52, 53, 54, 55, 56, 57, 58, 59, 60,
 
 static void map_module(const char *path) {
   void *library = dlopen(path, RTLD_NOW | RTLD_LOCAL);
-  if (library == NULL) give_up(dlerror());
+  if (library == NULL) give_up(__LINE__, dlerror());
   *(void **)&init_module = dlsym(library, "init_module");
   *(void **)&cleanup_module = dlsym(library, "cleanup_module");
   *(void **)&create = dlsym(library, "KARSTResolver_Create");
@@ -437,18 +411,9 @@ static void tell_object(uint32_t status) {
 }
 static void note_state(void *state_seen, void *instance, uint32_t state) {
   CHECK_BYTES(instance, "karstri", 8);
-  CHECK(held == 2);
   *(uint32_t *)state_seen = state;
 }
 
-static void fails_to_load(void) {
-  next_lock_status = REFUSED;
-  CHECK(init_module() != 0);
-  next_lock_status = OK;
-  CHECK(strstr(last_line, "KARSTResolver log: KARSTResolverCacheInit:") == last_line);
-  CHECK(strstr(last_line, ": Failed to create spinlock: REFUSED\n") != NULL);
-  CHECK(alive == 0);
-}
 static void loads_and_learns(void) {
   CHECK(init_module() == 0);
   CHECK_BYTES(cache, "karstrc", 8);
@@ -467,18 +432,18 @@ static uint32_t read_out(void *instance) {
   return get_locators(instance, answer);
 }
 
-static void answers_for_a_node(void) {
-  enum { TYPE = 0x1234567 };
+static void answers_for_an_object(void) {
   void *instance = NULL;
   uint32_t state = 99;
   const uint64_t sequence = stream.sequence, *traced = stream.ring[sequence];
-  CHECK(create(&instance, TYPE, nobody, node, false) == OK);
+  CHECK(create(&instance, OBJECT, object, node, false) == OK);
   CHECK(traced[0] == (1 | 0xda << 1 | 3007 << 9));               /* first lap, processor, time */
   CHECK(traced[1] == (8 | 1 << 6 | 485 << 20 | sequence << 35)); /* kind, event, line, sequence */
-  CHECK(traced[2] == (uintptr_t)instance && traced[3] == TYPE && traced[4] == 0 && traced[5] == 0);
+  CHECK(traced[2] == (uintptr_t)instance && traced[3] == OBJECT);
+  CHECK_BYTES(traced + 4, &object, 16);
   CHECK_BYTES(traced + 6, &node, 16);
-  CHECK_TEXT((char *)instance + 32, "node:10111213-1415-1617-1819-1a1b1c1d1e1f");
-  CHECK(number_at(instance, 132, 4) == TYPE);
+  CHECK_TEXT((char *)instance + 32, "object:30313233-3435-3637-3839-3a3b3c3d3e3f");
+  CHECK(number_at(instance, 132, 4) == OBJECT);
 
   CHECK(read_out(instance) == OK);
   CHECK_BYTES(answer, &node, 16);
@@ -493,16 +458,6 @@ static void answers_for_a_node(void) {
   state = 99;
   tell_interface(0xb1);
   CHECK(state == 1 && read_out(instance) == OK && answer[56] == 0xb1);
-  destroy(instance);
-}
-static void answers_for_an_object(void) {
-  void *instance = NULL;
-  uint32_t state = 99;
-  CHECK(create(&instance, OBJECT, object, nobody, false) == OK);
-  CHECK_TEXT((char *)instance + 32, "object:30313233-3435-3637-3839-3a3b3c3d3e3f");
-  CHECK(read_out(instance) == OK && answer[56] == 0xb1);
-  set_callback(instance, note_state, &state);
-  CHECK(state == 1);
   tell_object(NOT_FOUND);
   CHECK(state == 2 && read_out(instance) == NOT_FOUND);
   destroy(instance);
@@ -510,17 +465,14 @@ static void answers_for_an_object(void) {
 static void disables_and_unloads(void) {
   status_fn(cache, 0);
   cleanup_module();
-  CHECK(alive == 0 && held == 0);
-  CHECK_TEXT(subscribed, "+3+6+7+9-9-6-3-7");
+  CHECK(alive == 0);
 }
 
 int main(int argc, char **argv) {
-  if (argc != 2) give_up("usage: contract_test karst_resolver.so");
+  if (argc != 2) give_up(__LINE__, "usage: contract_test karst_resolver.so");
   map_module(argv[1]);
-  fails_to_load();
   loads_and_learns();
-  answers_for_a_node();
   answers_for_an_object();
   disables_and_unloads();
-  return failures == 0 ? 0 : 1;
+  return 0;
 }

@@ -8,7 +8,6 @@
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
-#include <regex>
 
 #include "host/directory/records.h"
 #include "host/sources/cluster_file_source.h"
@@ -23,14 +22,11 @@ using host::Entry;
 using host::toString;
 using namespace testing;
 
-/* UUIDs that end in two digits of choice; in a file, @a1 stands for the one that ends in a1. */
+/* UUIDs that end in two digits of choice. */
 const std::string begin = "00000000-0000-4000-8000-0000000000";
 
 zel_UUID uuid(const std::string &end) {
   return host::parseUUID(begin + end).value();
-}
-std::string expand(const std::string &text) {
-  return std::regex_replace(text, std::regex("@([a-c]\\d)"), "\"" + begin + "$1\"");
 }
 Entry node(const char *end, const KarstNodeEntry &record) {
   return {KARST_TYPE_NODE, uuid(end), uuid(end), host::encode(record)};
@@ -56,12 +52,14 @@ KarstIpAddress address(const std::string &text) {
 /* What is seen of them in an answer: transcripts/resolve.txt. */
 TEST(ClusterFile, FieldsThatNoAnswerShowsBecomeEntriesAllTheSame) {
   const auto content = host::parseClusterText(
-      expand(R"({"$schema":"cluster.schema.json", "nodes":[{"uuid":@a2, "interfaces":[
-        {"uuid":@b1, "addresses":["2001:db8::7"], "ipv4":"198.51.100.7",
-         "trafficTypes":[0,1,63], "mac":"02:00:00:00:0a:FF", "bandwidth":9223372036854775807,
-         "agentGroupPort":12345, "masterGroupPort":23451, "multicastTTL":5,
-         "agentV6Group":"ff02::2", "masterV6Group":"ff02::1",
-         "healthy":false, "healthFlags":6}]}]})"),
+      R"({"$schema":"cluster.schema.json",
+          "nodes":[{"uuid":"00000000-0000-4000-8000-0000000000a2",
+            "interfaces":[{"uuid":"00000000-0000-4000-8000-0000000000b1",
+              "addresses":["2001:db8::7"], "ipv4":"198.51.100.7", "trafficTypes":[0,1,63],
+              "mac":"02:00:00:00:0a:FF", "bandwidth":9223372036854775807,
+              "agentGroupPort":12345, "masterGroupPort":23451, "multicastTTL":5,
+              "agentV6Group":"ff02::2", "masterV6Group":"ff02::1",
+              "healthy":false, "healthFlags":6}]}]})",
       "c.json");
   const KarstNetInterfaceEntry whole{
       .networkType = 1,
@@ -90,7 +88,7 @@ TEST(ClusterFile, AChangeBetweenLoadAndWatchIsSeen) {
   host::ClusterFileSource source(path, directory);
   std::ofstream(path) << R"({"nodes":[]})";
   source.load();
-  std::ofstream(path) << expand(R"({"nodes":[{"uuid":@a1}]})");
+  std::ofstream(path) << R"({"nodes":[{"uuid":")" << begin << R"(a1"}]})";
   size_t changed = 0;
   source.watch([&](const host::Reload &report) { changed += report.difference.changed.size(); });
   EXPECT_EQ(changed, 1u);

@@ -42,24 +42,6 @@ void expectDecoded(const std::string &text, const Record &expected) {
   EXPECT_EQ(std::memcmp(&decoded, &expected, sizeof decoded), 0) << text;
 }
 
-KarstNetInterfaceEntry interfaceRecord() {
-  KarstNetInterfaceEntry record{};
-  record.networkType = KARST_NETWORK_TYPE_IP;
-  record.ipv4Address[0] = 192;
-  record.agentGroupPort = 23451;
-  record.masterGroupPort = 12345;
-  record.multicastTTL = 5;
-  record.bandwidth = 10'000'000'000;
-  record.macAddress[5] = 1;
-  record.agentV6Group[0] = 0xff;
-  record.masterV6Group[2] = 0x02;
-  record.numIpAddresses = 7;
-  record.ipAddresses[0].address[3] = 9;
-  record.ipAddresses[1] = {1, {}, {0, 0, 7}};
-  record.trafficTypeMask = UINT64_MAX;
-  return record;
-}
-
 const std::string interfaceWire =
     "aa 'networkType' a2 'type' 01 'ipv4' 44 c0000000"
     "'agentGroupPort' 19 5b9b 'masterGroupPort' 19 3039 'multicastTTL' 05"
@@ -80,7 +62,20 @@ TEST(Marshaller, RecordsTravelAsMapsByFieldName) {
                  "'requiredTolmMajorVersion' 19 0100 'requiredTolmMinorVersion' 1a 00010000");
   expectBothWays(KarstHealthStatusEntry{1, 0, 0x1'0000'0000, UINT32_MAX, 0},
                  "a3 'healthFlags' 01 'timestamp' 1b 0000000100000000 'healthReason' 1a ffffffff");
-  KarstNetInterfaceEntry record = interfaceRecord();
+  KarstNetInterfaceEntry record{};
+  record.networkType = KARST_NETWORK_TYPE_IP;
+  record.ipv4Address[0] = 192;
+  record.agentGroupPort = 23451;
+  record.masterGroupPort = 12345;
+  record.multicastTTL = 5;
+  record.bandwidth = 10'000'000'000;
+  record.macAddress[5] = 1;
+  record.agentV6Group[0] = 0xff;
+  record.masterV6Group[2] = 0x02;
+  record.numIpAddresses = 7;
+  record.ipAddresses[0].address[3] = 9;
+  record.ipAddresses[1] = {1, {}, {0, 0, 7}};
+  record.trafficTypeMask = UINT64_MAX;
   expectBothWays(record, interfaceWire);
   record.networkType = 9; /* which has no IPv4 address */
   EXPECT_EQ(host::encode(record), wire("aa 'networkType' a1 'type' 09" +

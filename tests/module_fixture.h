@@ -22,19 +22,6 @@ struct Client {
   std::vector<uint32_t> states; /* one a callback */
 };
 
-/* The addresses of locators: "10.0.0.1", "fd00::1". */
-inline std::vector<std::string> textsOf(const KARSTResolverNodeLocators &set) {
-  std::vector<std::string> texts;
-  for (uint16_t i = 0; i < set.count; i++) {
-    const bool isIPv6 = set.locators[i].networkType == KARST_RESOLVER_LOCATOR_IPV6;
-    char text[INET6_ADDRSTRLEN] = "";
-    EXPECT_TRUE(isIPv6 || set.locators[i].networkType == KARST_RESOLVER_LOCATOR_IPV4);
-    inet_ntop(isIPv6 ? AF_INET6 : AF_INET, set.locators[i].address, text, sizeof text);
-    texts.emplace_back(text);
-  }
-  return texts;
-}
-
 class Bench {
  public:
   explicit Bench(const sim::Settings &settings = defaults()) : sim(settings) {

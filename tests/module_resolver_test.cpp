@@ -55,7 +55,6 @@ TEST_F(Resolver, CreateSaysWhyItFails) {
 }
 
 TEST_F(Resolver, ReadOutWritesWhatItSaysAndNothingElse) {
-  const std::vector<std::string> all = {"10.0.0.2", "fd00::2", "10.0.0.22"};
   putNetIf(2, 2, {"10.0.0.2", "fd00::2", "10.0.0.22"});
   sim.run();
   Client client;
@@ -67,14 +66,18 @@ TEST_F(Resolver, ReadOutWritesWhatItSaysAndNothingElse) {
     bytes = before;
     return read(client, reinterpret_cast<KARSTResolverNodeLocators *>(bytes.data()));
   };
+  ASSERT_EQ(readWith(9), ZEL_OK);
+  const std::vector<uint8_t> whole = bytes;
   for (const uint16_t capacity : {0, 2, 3, 9}) {
     SCOPED_TRACE(capacity);
     ASSERT_EQ(readWith(capacity), ZEL_OK);
     const auto &set = *reinterpret_cast<KARSTResolverNodeLocators *>(bytes.data());
     EXPECT_EQ(set.capacity, capacity);
-    const size_t size = KARSTResolverNodeLocatorsSize(set.count);
-    EXPECT_EQ(textsOf(set), std::vector(all.begin(), all.begin() + std::min<int>(capacity, 3)));
-    EXPECT_TRUE(std::equal(bytes.begin() + size, bytes.end(), before.begin() + size));
+    EXPECT_EQ(set.count, std::min<int>(capacity, 3));
+    const auto first = static_cast<long>(KARSTResolverNodeLocatorsSize(0)),
+               end = static_cast<long>(KARSTResolverNodeLocatorsSize(set.count));
+    EXPECT_TRUE(std::equal(&bytes[first], &bytes[end], &whole[first]));
+    EXPECT_TRUE(std::equal(bytes.begin() + end, bytes.end(), before.begin() + end));
   }
   putHealth(2, 1);
   sim.run();

@@ -59,7 +59,8 @@ TEST(ClusterFile, FieldsThatNoAnswerShowsBecomeEntriesAllTheSame) {
               "mac":"02:00:00:00:0a:FF", "bandwidth":9223372036854775807,
               "agentGroupPort":12345, "masterGroupPort":23451, "multicastTTL":5,
               "agentV6Group":"ff02::2", "masterV6Group":"ff02::1",
-              "healthy":false, "healthFlags":6}]}]})",
+              "healthy":false, "healthFlags":6},
+             {"uuid":"00000000-0000-4000-8000-0000000000b2", "healthy":false}]}]})",
       "c.json");
   const KarstNetInterfaceEntry whole{
       .networkType = 1,
@@ -77,8 +78,10 @@ TEST(ClusterFile, FieldsThatNoAnswerShowsBecomeEntriesAllTheSame) {
       .ipAddresses = {address("2001:db8::7")},
       .trafficTypeMask = 0x8000000000000003,
   };
-  EXPECT_THAT(content.entries, ElementsAre(node("a2", {}), interface(uuid("b1"), "a2", whole),
-                                           health(uuid("b1"), "a2", 6)));
+  const zel_UUID b1 = uuid("b1"), b2 = uuid("b2");
+  EXPECT_THAT(content.entries,
+              ElementsAre(node("a2", {}), interface(b1, "a2", whole), interface(b2, "a2"),
+                          health(b1, "a2", 6), health(b2, "a2", 1)));
 }
 
 /* How a watch reads it however it changes: transcripts/watch.txt. */

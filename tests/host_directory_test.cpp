@@ -168,6 +168,8 @@ TEST_F(DirectoryTest, WholeEntryIsThePresentOneInABlockOfTheCallers) {
   EXPECT_EQ(std::string(reinterpret_cast<char *>(whole + 1), whole->header.dataLength),
             "\7\7\7\7\7\7\7\7");
   std::free(whole);
+  allocator.alloc = [](void *, uint64_t) -> void * { return nullptr; };
+  EXPECT_EQ(directory.findFullEntry(header, allocator, &whole), ZEL_NO_MEMORY);
 }
 
 /* ---- What subscribers are told --------------------------------------------------------------- */

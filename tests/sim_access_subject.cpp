@@ -12,9 +12,6 @@ uint64_t load(const uint64_t *word) {
 void store(uint64_t *word, uint64_t value) {
   *word = value;
 }
-uint8_t loadByte(const void *memory) {
-  return *static_cast<const uint8_t *>(memory);
-}
 void storeByte(void *memory, uint8_t value) {
   *static_cast<uint8_t *>(memory) = value;
 }

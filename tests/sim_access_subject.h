@@ -13,7 +13,6 @@ extern uint64_t flag;      /* and what they synchronise by */
 
 uint64_t load(const uint64_t *word);
 void store(uint64_t *word, uint64_t value);
-uint8_t loadByte(const void *memory);
 void storeByte(void *memory, uint8_t value);
 void fill(void *memory, size_t size);
 void copy(void *to, const void *from, size_t size);

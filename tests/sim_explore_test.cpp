@@ -181,6 +181,7 @@ TEST(Strategy, FindsAFaultWithinSoManyRunsAndRepeatsIt) {
   EXPECT_EQ(command(options + "exhaustive:0").status, 0);
   const Answer whole = command(options + "pct:1");
   EXPECT_EQ(whole.status, 0);
+  EXPECT_THAT(whole.text, HasSubstr("200 runs of 1 scenarios"));
   EXPECT_THAT(whole.text, HasSubstr("about 2 different ones"));
 }
 

@@ -22,11 +22,6 @@ void copy(void *to, const void *from, size_t size) {
   __builtin_memcpy(to, from, size);
 }
 
-void withLocal(void (*use)(uint64_t *word)) {
-  uint64_t word = 0;
-  use(&word);
-}
-
 void *allocate(zel_HeapID heap, uint32_t size) {
   void *block = zel_HeapAllocWithRA(heap, size, nullptr);
   __asm__ volatile("");

@@ -17,9 +17,6 @@ void storeByte(void *memory, uint8_t value);
 void fill(void *memory, size_t size);
 void copy(void *to, const void *from, size_t size);
 
-/* Calls `use` with a word on its own stack. */
-void withLocal(void (*use)(uint64_t *word));
-
 void *allocate(zel_HeapID heap, uint32_t size);
 
 /* Store through another function, so that its frame shows. */

@@ -67,12 +67,15 @@ std::vector<Item> itemsFrom(const std::string &text, Item (*read)(const std::str
   return items;
 }
 
+[[noreturn]] void refuse(const std::string &text, const char *what) {
+  throw std::invalid_argument("\"" + text + "\" is no " + what);
+}
+
 uint32_t numberFrom(const std::string &text, int base = 10) {
   uint32_t number = 0;
   const char *const end = text.data() + text.size();
   const auto [stop, error] = std::from_chars(text.data(), end, number, base);
-  if (text.empty() || error != std::errc() || stop != end)
-    throw std::invalid_argument("\"" + text + "\" is no number");
+  if (text.empty() || error != std::errc() || stop != end) refuse(text, "number");
   return number;
 }
 
@@ -82,7 +85,7 @@ std::string operationText(const Operation &operation) {
 }
 
 Operation operationFrom(const std::string &text) {
-  if (text.size() != 12) throw std::invalid_argument("\"" + text + "\" is no operation");
+  if (text.size() != 12) refuse(text, "operation; write 12 hexadecimal digits");
   const auto byte = [&](size_t place) {
     return static_cast<uint8_t>(numberFrom(text.substr(2 * place, 2), 16));
   };
@@ -98,7 +101,7 @@ PlannedFault faultFrom(const std::string &text) {
   for (size_t call = 0; call < callCount && parts.size() == 3; ++call)
     if (callTraits[call].name == parts[0])
       return {static_cast<Call>(call), numberFrom(parts[1]), numberFrom(parts[2])};
-  throw std::invalid_argument("\"" + text + "\" is no fault");
+  refuse(text, "fault; write CALL:USE:TIMES");
 }
 
 std::string deviationText(const Deviation &deviation) {
@@ -107,7 +110,7 @@ std::string deviationText(const Deviation &deviation) {
 
 Deviation deviationFrom(const std::string &text) {
   const std::vector<std::string> parts = split(text, ':');
-  if (parts.size() != 2) throw std::invalid_argument("\"" + text + "\" is no deviation");
+  if (parts.size() != 2) refuse(text, "deviation; write CHOICE:ANSWER");
   return {numberFrom(parts[0]), numberFrom(parts[1])};
 }
 

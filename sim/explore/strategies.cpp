@@ -175,6 +175,13 @@ bool BoundedSearch::advance() {
 
 namespace {
 
+[[noreturn]] void refuse(const std::string &text) {
+  throw std::invalid_argument(
+      "\"" + text +
+      "\" is no strategy; write default, random[:N], pct[:DEPTH[:LENGTH]] or "
+      "exhaustive[:PREEMPTIONS]");
+}
+
 /* The numbers behind the colons of a name. */
 std::vector<uint32_t> numbersOf(const std::string &text) {
   std::vector<uint32_t> numbers;
@@ -184,7 +191,7 @@ std::vector<uint32_t> numbersOf(const std::string &text) {
     const char *const last = after == std::string::npos ? end : text.data() + after;
     uint32_t number = 0;
     const auto [stop, error] = std::from_chars(text.data() + colon + 1, last, number);
-    if (error != std::errc() || stop != last) throw std::invalid_argument(text);
+    if (error != std::errc() || stop != last) refuse(text);
     numbers.push_back(number);
     colon = after;
   }
@@ -226,11 +233,10 @@ StrategyName StrategyName::parse(const std::string &text) {
   } else if (word == "exhaustive") {
     name = {Kind::Exhaustive, number(0, 2), 0};
   } else {
-    throw std::invalid_argument(text);
+    refuse(text);
   }
   const bool mayBeZero = name.kind == Kind::Exhaustive;
-  if (numbers.size() > most || (name.parameter == 0 && !mayBeZero))
-    throw std::invalid_argument(text);
+  if (numbers.size() > most || (name.parameter == 0 && !mayBeZero)) refuse(text);
   return name;
 }
 

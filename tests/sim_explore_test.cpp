@@ -163,7 +163,7 @@ Answer command(const std::string &options) {
   testing::internal::CaptureStderr();
   const int status =
       sim::explore(static_cast<int>(arguments.size()), arguments.data(), scenarios,
-                   {.program = "toys", .watched = "watched.so", .plain = "plain.so"});
+                   {.program = "toys", .watched = "watched.so", .plain = "sim_explore_test"});
   const std::string errors = testing::internal::GetCapturedStderr();
   return {status, testing::internal::GetCapturedStdout() + errors};
 }

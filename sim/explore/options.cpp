@@ -98,14 +98,21 @@ CommandLine::CommandLine(const ExploreDefaults &defaults) {
   app.add_option("--json", options.json, "Write the figures to a file")->type_name("FILE");
 }
 
-/* Beside the program. */
-std::filesystem::path moduleFor(const CommandLine &line, const ExploreDefaults &defaults) {
-  if (!line.module.empty()) return std::filesystem::absolute(line.module);
+/* Its own, or one beside the program. */
+void chooseModule(CommandLine &line, const ExploreDefaults &defaults) {
+  Options &options = line.options;
+  options.moduleChosen = !line.module.empty() || line.watched || line.plain;
+  if (!line.module.empty()) {
+    options.module = std::filesystem::absolute(line.module);
+    options.moduleOption = "--module " + line.module;
+    return;
+  }
   const std::filesystem::path folder =
       std::filesystem::read_symlink("/proc/self/exe").parent_path();
   const bool haveWatched = std::filesystem::exists(folder / defaults.watched);
-  return folder /
-         (line.watched || (haveWatched && !line.plain) ? defaults.watched : defaults.plain);
+  const bool watched = line.watched || (haveWatched && !line.plain);
+  options.module = folder / (watched ? defaults.watched : defaults.plain);
+  options.moduleOption = watched ? "--watched" : "--plain";
 }
 
 Options CommandLine::complete(const ExploreDefaults &defaults) {
@@ -116,7 +123,7 @@ Options CommandLine::complete(const ExploreDefaults &defaults) {
   if (!schedule.empty()) options.schedule = schedule;
   if (options.oneCase() && options.scenario == "all")
     throw UsageError("a plan or a schedule belongs to a scenario; give --scenario NAME");
-  options.module = moduleFor(*this, defaults);
+  chooseModule(*this, defaults);
   return options;
 }
 
@@ -132,7 +139,11 @@ std::optional<Options> parseOptions(int argc, char **argv, const ExploreDefaults
   } catch (const CLI::ParseError &error) {
     throw UsageError(std::string(error.what()) + "\n" + defaults.program + " --help shows how");
   }
-  return line.complete(defaults);
+  Options options = line.complete(defaults);
+  if (options.moduleChosen && !std::filesystem::exists(options.module))
+    throw UsageError(options.module.string() +
+                     ": there is no such file; build it, or give another --module");
+  return options;
 }
 
 Options parseLine(const std::string &text, const ExploreDefaults &defaults) {

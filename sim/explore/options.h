@@ -37,6 +37,8 @@ struct Options {
   bool oneCase() const { return operations || faults || schedule; }
 
   std::filesystem::path module;
+  std::string moduleOption;  /* that chooses it */
+  bool moduleChosen = false; /* and stood on the command line */
   unsigned jobs = 1;
   uint64_t shortenRuns = 4000;
   std::filesystem::path json; /* empty: not asked for */

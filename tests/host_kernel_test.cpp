@@ -13,29 +13,13 @@
 #include "platform/qxt.h"
 #include "platform/tolm.h"
 #include "tests/log_lines.h"
+#include "tests/test_heap.h"
 
 namespace {
 
 using testing::ElementsAre;
 using testing::HasSubstr;
 using testing::IsEmpty;
-
-/* A heap that ends with its scope; a test that leaves blocks in it does so on purpose. */
-struct TestHeap {
-  explicit TestHeap(uint32_t maximum) {
-    zel_HeapProps props{};
-    zel_NameInitialize(&props.name, "test");
-    props.maximumSize = maximum;
-    EXPECT_EQ(zel_HeapCreate(&props, &id), ZEL_OK);
-  }
-  ~TestHeap() { zel_HeapDestroy(id); }
-  void *allocate(uint32_t size, void *asker = nullptr) {
-    return zel_HeapAllocWithRA(id, size, asker);
-  }
-  void free(void *block) { zel_HeapFree(id, block); }
-
-  zel_HeapID id = ZEL_NO_HEAP;
-};
 
 /* ---- UUIDs and text -------------------------------------------------------------------------- */
 
@@ -69,17 +53,17 @@ TEST(Heap, HoldsExactlyWhatTheSizingFunctionSays) {
     TestHeap heap(10 * space);
     std::vector<void *> taken(10);
     for (void *&block : taken) {
-      block = heap.allocate(size);
+      block = heap.get(size);
       ASSERT_NE(block, nullptr);
       EXPECT_EQ(reinterpret_cast<uintptr_t>(block) % 16, 0u);
     }
     EXPECT_EQ(host::heapState(heap.id).used, 10 * space);
-    EXPECT_EQ(heap.allocate(0), nullptr) << "the heap is full";
-    heap.free(taken[3]);
-    EXPECT_EQ(heap.allocate(size + 16), nullptr) << "only " << size << " bytes are free";
-    EXPECT_EQ(heap.allocate(0xffffffff), nullptr) << "sizes do not wrap around";
-    taken[3] = heap.allocate(size);
-    for (void *block : taken) heap.free(block);
+    EXPECT_EQ(heap.get(0), nullptr) << "the heap is full";
+    heap.put(taken[3]);
+    EXPECT_EQ(heap.get(size + 16), nullptr) << "only " << size << " bytes are free";
+    EXPECT_EQ(heap.get(0xffffffff), nullptr) << "sizes do not wrap around";
+    taken[3] = heap.get(size);
+    for (void *block : taken) heap.put(block);
     EXPECT_EQ(host::heapState(heap.id).used, 0u);
     EXPECT_EQ(host::heapState(heap.id).peak, 10 * space);
   }
@@ -92,8 +76,8 @@ TEST(Heap, ReportsAtItsEndWhatIsAliveAndWhoAskedForIt) {
   {
     TestHeap heap(4096);
     const auto asker = reinterpret_cast<char *>(&host::setLogThreshold) + 4;
-    heap.allocate(24, asker);
-    heap.allocate(40, asker);
+    heap.get(24, asker);
+    heap.get(40, asker);
   }
   EXPECT_THAT(log.texts,
               ElementsAre(HasSubstr("heap test: block of 24 bytes"),
@@ -104,12 +88,12 @@ TEST(Heap, ReportsAtItsEndWhatIsAliveAndWhoAskedForIt) {
 TEST(HeapDeathTest, StopsOnBlocksThatAreNotAlive) {
   TestHeap heap(4096);
   TestHeap other(4096);
-  auto *const block = static_cast<char *>(heap.allocate(32));
-  EXPECT_DEATH((heap.free(block), heap.free(block)), "panic: freeing 0x[0-9a-f]+, which is not");
-  EXPECT_DEATH(heap.free(block + 16), "is not alive in heap");
-  EXPECT_DEATH(other.free(block), "is not alive in heap");
+  auto *const block = reinterpret_cast<char *>(heap.get(32));
+  EXPECT_DEATH((heap.put(block), heap.put(block)), "panic: freeing 0x[0-9a-f]+, which is not");
+  EXPECT_DEATH(heap.put(block + 16), "is not alive in heap");
+  EXPECT_DEATH(other.put(block), "is not alive in heap");
   EXPECT_DEATH(zel_HeapAllocWithRA(0x123456, 16, nullptr), "there is no heap 0x123456");
-  heap.free(block);
+  heap.put(block);
 }
 
 /* ---- Log ------------------------------------------------------------------------------------- */

@@ -16,6 +16,7 @@
 #include "host/threads/worlds.h"
 #include "platform/tolm.h"
 #include "tests/log_lines.h"
+#include "tests/test_heap.h"
 
 using testing::ContainsRegex;
 
@@ -24,68 +25,38 @@ namespace {
 using Body = std::function<void()>;
 using Locks = std::vector<zel_SpinlockHandle>;
 
-zel_HeapID newHeap(uint32_t size) {
-  zel_HeapProps props{};
-  props.maximumSize = size;
-  zel_HeapID heap = ZEL_NO_HEAP;
-  EXPECT_EQ(host::heapCreate(props, &heap), ZEL_OK);
-  return heap;
-}
-
 zel_Status wait(uint32_t timeout = ZEL_TIMEOUT_NONE) {
   return zel_WorldWait(0, ZEL_NO_SPINLOCK, timeout, "for the test");
 }
 
-/* A heap, a domain and a lock; at its end nothing may be left alive. */
-class Threads : public testing::Test {
+/* With a first lock; at its end nothing may be left alive. */
+class Threads : public testing::Test, protected TestLocks {
  protected:
   Threads() {
     GTEST_FLAG_SET(death_test_style, "threadsafe");
     host::configureWorlds({});
-    const zel_Name name = lockProps("Test", 0).name;
-    EXPECT_EQ(zel_LockDomainCreate(1, heap, &name, &domain), ZEL_OK);
-    lock = newLock("First", 5);
-    usedAtStart = used();
   }
   ~Threads() override {
     if (lock != ZEL_NO_SPINLOCK) zel_SpinlockDestroy(lock);
-    if (domain != ZEL_NO_LOCK_DOMAIN) zel_LockDomainDestroy(domain);
+    end();
     EXPECT_THAT(host::aliveWorldsAndLocks(), testing::IsEmpty());
     EXPECT_EQ(used(), 0u);
-    host::heapDestroy(heap);
   }
 
-  uint32_t used() const { return host::heapState(heap).used; }
+  uint32_t used() const { return host::heapState(id).used; }
 
-  zel_SpinlockProps lockProps(const char *name, uint16_t rank) const {
-    zel_SpinlockProps props{};
-    props.heap = heap;
-    host::fillName(&props.name, name);
-    props.type = ZEL_SPINLOCK_RANKED;
-    props.domain = domain;
-    props.rank = rank;
-    return props;
-  }
-  zel_SpinlockHandle newLock(const char *name, uint16_t rank) const {
-    const zel_SpinlockProps props = lockProps(name, rank);
-    zel_SpinlockHandle made = ZEL_NO_SPINLOCK;
-    EXPECT_EQ(zel_SpinlockCreate(&props, &made), ZEL_OK);
-    return made;
-  }
   static zel_Status start(zel_WorldID &world, const char *name, Body &body, zel_HeapID from) {
     const auto run = [](void *data) { return (*static_cast<Body *>(data))(), 0u; };
     return TOLM_WorldCreate(&world, name, 1, run, &body, 1, from);
   }
   zel_WorldID start(const char *name, Body &body) const {
     zel_WorldID world = ZEL_NO_WORLD;
-    EXPECT_EQ(start(world, name, body, heap), ZEL_OK);
+    EXPECT_EQ(start(world, name, body, id), ZEL_OK);
     return world;
   }
 
-  zel_HeapID heap = newHeap(1 << 20);
-  zel_LockDomainID domain = ZEL_NO_LOCK_DOMAIN;
-  zel_SpinlockHandle lock = ZEL_NO_SPINLOCK;
-  uint32_t usedAtStart = 0;
+  zel_SpinlockHandle lock = make("First", 5);
+  const uint32_t usedAtStart = used();
 };
 
 /* ---- Spinlocks ------------------------------------------------------------------------------- */
@@ -97,7 +68,7 @@ using Spinlocks = Threads;
 TEST_F(Spinlocks, ExcludeEachOtherAndMayBeDestroyedByTheirLastUserAtOnce) {
   constexpr int kRounds = 500, kEach = 100;
   for (int round = 0; round < kRounds; ++round) {
-    const zel_SpinlockHandle shared = newLock("Shared", 1);
+    const zel_SpinlockHandle shared = make("Shared", 1);
     EXPECT_EQ(used() - usedAtStart, zel_SpinlockAllocSize(ZEL_SPINLOCK_RANKED));
     int counter = 0; /* plain: only the lock guards it */
     const auto count = [&] {
@@ -117,23 +88,23 @@ TEST_F(Spinlocks, ExcludeEachOtherAndMayBeDestroyedByTheirLastUserAtOnce) {
 }
 
 TEST_F(Spinlocks, AreRefusedWithoutMemoryAsWorldsAre) {
-  zel_SpinlockProps props = lockProps("Refused", 1);
+  const TestHeap tiny(16);
+  zel_SpinlockProps refused = props("Refused", 1);
   zel_SpinlockHandle untouched = 42;
   zel_WorldID world = 42;
   Body none;
-  props.heap = newHeap(16);
-  EXPECT_EQ(zel_SpinlockCreate(&props, &untouched), ZEL_NO_MEMORY);
-  EXPECT_EQ(start(world, "none", none, props.heap), ZEL_NO_MEMORY);
+  refused.heap = tiny.id;
+  EXPECT_EQ(zel_SpinlockCreate(&refused, &untouched), ZEL_NO_MEMORY);
+  EXPECT_EQ(start(world, "none", none, tiny.id), ZEL_NO_MEMORY);
   EXPECT_EQ(untouched, 42u);
   EXPECT_EQ(world, 42u);
-  host::heapDestroy(props.heap);
 }
 
 TEST_F(Spinlocks, LeftBehindAreReportedByTheirDomainAndReleased) {
   const LogLines log;
-  zel_LockDomainDestroy(std::exchange(domain, ZEL_NO_LOCK_DOMAIN));
+  end();
   lock = ZEL_NO_SPINLOCK;
-  EXPECT_THAT(log.texts, testing::ElementsAre(ContainsRegex("Test.*First")));
+  EXPECT_THAT(log.texts, testing::ElementsAre(ContainsRegex("test.*First")));
   EXPECT_EQ(used(), 0u);
 }
 
@@ -171,13 +142,13 @@ TEST_F(Worlds, KnowTheirIDBeforeTheyRunStopAtEveryWaitAndLeaveNothingBehind) {
       zel_WorldForceWakeup(seen);
       last = wait();
     };
-    ASSERT_EQ(start(world, "brief", body, heap), ZEL_OK);
-    const zel_WorldID id = world;
-    EXPECT_NE(id, target.exchange(id)) << "the last one's";
+    ASSERT_EQ(start(world, "brief", body, id), ZEL_OK);
+    const zel_WorldID created = world;
+    EXPECT_NE(created, target.exchange(created)) << "the last one's";
     EXPECT_GT(used(), usedAtStart); /* the record is the given heap's */
     TOLM_WorldDestroy(&world);
     EXPECT_EQ(std::tuple(seen, last, world, used()),
-              std::tuple(id, ZEL_WORLD_STOPPING, ZEL_NO_WORLD, usedAtStart));
+              std::tuple(created, ZEL_WORLD_STOPPING, ZEL_NO_WORLD, usedAtStart));
   }
 }
 
@@ -190,7 +161,7 @@ TEST_F(Worlds, KeepAWakeUpThatComesBeforeTheWaitForOneWait) {
     first = wait();
     second = wait();
   };
-  start(world, "woken", body, heap);
+  start(world, "woken", body, id);
   host::waitUntilWorldsIdle();
   TOLM_WorldDestroy(&world);
   EXPECT_EQ(std::pair(first, second),
@@ -230,7 +201,6 @@ extern "C" [[gnu::noinline]] void takeAll(const Locks &locks) {
 class ThreadsDeathTest : public Threads {
  protected:
   ThreadsDeathTest() { host::configureWorlds({.stopTimeout = std::chrono::milliseconds(20)}); }
-  ~ThreadsDeathTest() override { std::for_each(more.begin(), more.end(), zel_SpinlockDestroy); }
 
   /* For bodies that must not come back. */
   void runToDeath(Body body) const {
@@ -238,8 +208,8 @@ class ThreadsDeathTest : public Threads {
     TOLM_WorldDestroy(&world);
   }
 
-  const Locks more{newLock("Equal", 5), newLock("Middle", 6), newLock("High", 7)};
-  const zel_SpinlockHandle equal = more[0], middle = more[1], high = more[2];
+  const zel_SpinlockHandle equal = keep("Equal", 5), middle = keep("Middle", 6),
+                           high = keep("High", 7);
 };
 
 TEST_F(ThreadsDeathTest, MistakesAreNamed) {

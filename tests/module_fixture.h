@@ -157,9 +157,8 @@ class Bench {
     return found;
   }
 
-  std::vector<std::string> log; /* the module's lines, with line numbers cut out */
-  std::vector<std::string>
-      leftBehind; /* that the module's heap and lock domain held at their end */
+  std::vector<std::string> log;        /* the module's lines, with line numbers cut out */
+  std::vector<std::string> leftBehind; /* in the module's heap and lock domain */
   sim::Simulation sim;
   host::Module *module = nullptr;
   decltype(KARSTResolver_Create) *create_ = nullptr;

@@ -18,7 +18,7 @@
 #include "sim/lock_order.h"
 #include "sim/simulation.h"
 #include "tests/sim_access_subject.h"
-#include "tests/sim_heap.h"
+#include "tests/test_heap.h"
 
 namespace {
 
@@ -37,7 +37,7 @@ constexpr const char *race = "a race: neither of two accesses happens before the
 struct Bench {
   sim::Simulation machine;
   sim::access::Recorder &recorder = machine.watch();
-  SimHeap heap;
+  TestLocks heap;
 };
 
 /* ---- Programs -------------------------------------------------------------------------------- */
@@ -164,7 +164,7 @@ class Play {
   }
 
   Bench bench_;
-  zel_SpinlockHandle lock_ = bench_.heap.lock("order", 1);
+  zel_SpinlockHandle lock_ = bench_.heap.keep("order", 1);
   host::Mutex mutex_;
   sim::HandOver hand_;
   uint64_t *block_ = bench_.heap.get(64);
@@ -321,7 +321,7 @@ TEST(Rules, KeepFreeSlotsUntouched) {
        .lock = "pool",
        .fields = {{8, 8, "link", Guard::Lock}, {16, 8, "value", Guard::Lock}}},
       {{offsetof(Slot, tag), 8}, "freefree", {{offsetof(Slot, link), 8}}}, pool, 2);
-  const zel_SpinlockHandle lock = bench.heap.lock("pool", 1);
+  const zel_SpinlockHandle lock = bench.heap.keep("pool", 1);
   requireReports(
       bench.machine,
       {{{lock},
@@ -355,9 +355,9 @@ const Structure thingStructure{
 TEST(Rules, AskForTheGuardOfAFieldOnceTheObjectIsShared) {
   Bench bench;
   bench.recorder.rules().blocks(thingStructure, "subject::allocate");
-  const zel_SpinlockHandle outer = bench.heap.lock("outer", 1);
-  const zel_SpinlockHandle own = bench.heap.lock("own", 2);
-  const zel_SpinlockHandle other = bench.heap.lock("own", 3);
+  const zel_SpinlockHandle outer = bench.heap.keep("outer", 1);
+  const zel_SpinlockHandle own = bench.heap.keep("own", 2);
+  const zel_SpinlockHandle other = bench.heap.keep("own", 3);
   Thing *thing = nullptr;
   bench.machine.call("creator", [&] {
     thing = static_cast<Thing *>(subject::allocate(bench.heap.id, sizeof(Thing)));
@@ -386,7 +386,7 @@ void nest(const std::vector<const char *> &names) {
   Bench bench;
   std::vector<zel_SpinlockHandle> locks;
   for (const char *name : names)
-    locks.push_back(bench.heap.lock(name, static_cast<uint16_t>(locks.size() + 1)));
+    locks.push_back(bench.heap.keep(name, static_cast<uint16_t>(locks.size() + 1)));
   bench.machine.call("nester", [&] {
     for (const zel_SpinlockHandle lock : locks) zel_SpinlockLock(lock);
     for (const zel_SpinlockHandle lock : locks) zel_SpinlockUnlock(lock);

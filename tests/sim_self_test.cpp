@@ -11,7 +11,7 @@
 #include "host/threads/sync.h"
 #include "platform/tolm.h"
 #include "sim/machine.h"
-#include "tests/sim_heap.h"
+#include "tests/test_heap.h"
 
 namespace {
 
@@ -25,9 +25,9 @@ using testing::ElementsAre;
 /* Where mistakes are made: on a fiber "culprit", with lock a of rank 1 and b of rank 2. */
 struct Scene {
   Machine machine{{.stepLimit = 200}};
-  SimHeap heap;
-  zel_SpinlockHandle a = heap.lock("lock a", 1);
-  zel_SpinlockHandle b = heap.lock("lock b", 2);
+  TestLocks heap;
+  zel_SpinlockHandle a = heap.keep("lock a", 1);
+  zel_SpinlockHandle b = heap.keep("lock b", 2);
   host::Mutex mutex;
 
   void commit(void (*mistake)(Scene &)) {
@@ -53,7 +53,7 @@ TEST(FatalDeathTest, SaysWhoDidWhat) {
       {[](Scene &s) { zel_SpinlockLock(s.a), zel_WorldSleep(1); },
        "culprit calls zel_WorldSleep while it holds spinlock \"lock a\""},
       {[](Scene &s) { zel_SpinlockLock(s.a); }, "culprit ends while it holds spinlock \"lock a\""},
-      {[](Scene &) { (new SimHeap)->lock("forgotten", 1); },
+      {[](Scene &) { (new TestLocks)->keep("forgotten", 1); },
        "left behind at the end of the simulation:\n  lock domain test\n"
        "  lock forgotten in domain test\n  heap test: 2 blocks"},
       /* Ann has the mutex and wants the spinlock, Bob the other way round. */
@@ -135,7 +135,7 @@ TEST(Holding, KeepsBackWhoComesLaterAsWell) {
 
 TEST(Faults, ComeAtExactlyTheUsesAsked) {
   Machine machine;
-  SimHeap heap;
+  TestLocks heap;
   machine.failAt(sim::Call::zel_HeapAllocWithRA, 2, 2);
   std::string got;
   for (int i = 0; i < 5; ++i) {

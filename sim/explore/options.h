@@ -37,8 +37,8 @@ struct Options {
   bool oneCase() const { return operations || faults || schedule; }
 
   std::filesystem::path module;
-  std::string moduleOption;  /* that chooses it */
-  bool moduleChosen = false; /* and stood on the command line */
+  std::string moduleOption;  /* the option that chooses this module */
+  bool moduleChosen = false; /* by such an option, and not by default */
   unsigned jobs = 1;
   uint64_t shortenRuns = 4000;
   std::filesystem::path json; /* empty: not asked for */

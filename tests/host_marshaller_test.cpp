@@ -92,7 +92,7 @@ TEST(Marshaller, TakesUnknownMissingAndIndefiniteThingsInAnyOrder) {
        "'macAddress' 5f 46 000000000001 ff 'numIpAddresses' 9f 44 00000000 5f 44 09000000 ff ff ff",
        "a3 'networkType' a2 'type' 01 'ipv4' 44 00000004 'macAddress' 46 000000000001"
        "'numIpAddresses' 82 44 00000000 44 09000000"},
-      {"a1 'networkType' a2 'type' 09 'ipv4' 44 c0000201", ofType9},
+      {"a1 'networkType' a2 7804 74797065 09 'ipv4' 44 c0000201", ofType9},
       {"a1 'networkType' a2 'ipv4' 44 c0000201 'type' 09", ofType9}};
   for (const auto &[text, plain] : rows) {
     KarstNetInterfaceEntry record;
@@ -105,6 +105,7 @@ const std::map<zel_Status, std::vector<std::string>> refusals = {
     {EXPR_MSH_MALFORMED,
      {"00", "a1 01 02", "bf 'x' ff", "a1 'bandwidth' ff", /* no map, no name, no value */
       "a1 'x' c1 ff", "a1 'x' f8 1f", "a1 'macAddress' 5f 5f 40 ff ff",
+      "a1 4b 6e6574776f726b54797065 a0",            /* the bytes of a name, and no text */
       "a1 'x' 81818181818181818181818181818181 00", /* 17 deep */
       "a2 'bandwidth' 01 'bandwidth' 01", "a1 'networkType' a2 'type' 01 'type' 01"}},
     {EXPR_MSH_BAD_TYPE,

@@ -26,14 +26,15 @@ enum class CborKind {
 struct CborItem {
   CborKind kind = CborKind::Other; /* what no field asks for: negative, float, simple */
   uint64_t number = 0;             /* value, length or count */
-  const uint8_t *bytes = nullptr;
-  bool indefinite = false; /* of a map or an array */
+  const uint8_t *bytes = nullptr;  /* of a string in one piece */
+  bool indefinite = false;         /* of a map or an array */
 };
 
 void setItem(void *context, CborKind kind, uint64_t number = 0) {
   CborItem &item = *static_cast<CborItem *>(context);
   item.kind = kind;
   item.number = number;
+  item.indefinite = false;
 }
 
 void setString(void *context, CborKind kind, cbor_data bytes, size_t length) {
@@ -98,8 +99,9 @@ zel_Status readUnassigned(ExprMshReader &reader, CborItem *item) {
   return ZEL_OK;
 }
 
-zel_Status readItem(ExprMshReader &reader, CborItem *item) {
-  *item = {};
+/* In line: some twenty times for each record. */
+[[gnu::always_inline]] inline zel_Status readItem(ExprMshReader &reader, CborItem *item) {
+  item->kind = CborKind::Other; /* it may have been read into before */
   if (reader.position >= reader.length) return EXPR_MSH_TRUNCATED;
   const cbor_decoder_result result = cbor_stream_decode(
       reader.data + reader.position, reader.length - reader.position, &itemCallbacks, item);
@@ -133,6 +135,20 @@ zel_Status readChunk(ExprMshReader &reader, CborKind kind, CborItem *chunk) {
   const zel_Status status = readItem(reader, chunk);
   if (status != ZEL_OK) return status;
   return chunk->kind == kind || chunk->kind == CborKind::Break ? ZEL_OK : EXPR_MSH_MALFORMED;
+}
+
+zel_Status readChunks(ExprMshReader &reader, size_t capacity, uint8_t *bytes, size_t *length) {
+  CborItem chunk;
+  for (size_t used = 0;; used += chunk.number) {
+    const zel_Status status = readChunk(reader, CborKind::Bytes, &chunk);
+    if (status != ZEL_OK) return status;
+    if (chunk.kind == CborKind::Break) {
+      *length = used;
+      return ZEL_OK;
+    }
+    if (chunk.number > capacity - used) return EXPR_MSH_OUT_OF_RANGE;
+    if (chunk.number != 0) std::memcpy(bytes + used, chunk.bytes, chunk.number);
+  }
 }
 
 zel_Status skipChunks(ExprMshReader &reader, CborKind kind) {
@@ -179,20 +195,6 @@ zel_Status openArray(ExprMshReader &reader, CborContainer *array) {
   return open(reader, CborKind::Array, array);
 }
 
-zel_Status nextElement(ExprMshReader &reader, CborContainer *container, bool *more) {
-  constexpr uint8_t breakByte = 0xff;
-  if (container->indefinite) {
-    if (reader.position >= reader.length) return EXPR_MSH_TRUNCATED;
-    *more = reader.data[reader.position] != breakByte;
-    if (!*more) ++reader.position;
-  } else {
-    *more = container->left != 0;
-    if (*more) --container->left;
-  }
-  if (!*more) --reader.depth;
-  return ZEL_OK;
-}
-
 zel_Status readName(ExprMshReader &reader, std::string_view *name) {
   CborItem item;
   const zel_Status status = readItem(reader, &item);
@@ -213,19 +215,15 @@ zel_Status readUnsigned(ExprMshReader &reader, uint64_t maximum, uint64_t *value
 
 zel_Status readBytes(ExprMshReader &reader, size_t capacity, uint8_t *bytes, size_t *length) {
   CborItem item;
-  zel_Status status = readValueOf(reader, CborKind::Bytes, &item);
-  const bool chunked = status == EXPR_MSH_BAD_TYPE && item.kind == CborKind::ChunkedBytes;
-  if (chunked) status = readChunk(reader, CborKind::Bytes, &item);
-  size_t used = 0;
-  while (status == ZEL_OK && item.kind == CborKind::Bytes) {
-    if (item.number > capacity - used) return EXPR_MSH_OUT_OF_RANGE;
-    if (item.number != 0) std::memcpy(bytes + used, item.bytes, item.number);
-    used += item.number;
-    if (!chunked) break;
-    status = readChunk(reader, CborKind::Bytes, &item);
+  const zel_Status status = readValueOf(reader, CborKind::Bytes, &item);
+  if (status == EXPR_MSH_BAD_TYPE && item.kind == CborKind::ChunkedBytes) {
+    return readChunks(reader, capacity, bytes, length);
   }
-  if (status == ZEL_OK) *length = used;
-  return status;
+  if (status != ZEL_OK) return status;
+  if (item.number > capacity) return EXPR_MSH_OUT_OF_RANGE;
+  if (item.number != 0) std::memcpy(bytes, item.bytes, item.number);
+  *length = item.number;
+  return ZEL_OK;
 }
 
 zel_Status skipValue(ExprMshReader &reader) {

@@ -5,6 +5,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <cstring>
 #include <string_view>
 #include <vector>
 
@@ -44,7 +45,34 @@ zel_Status openArray(ExprMshReader &reader, CborContainer *array);
 
 /* Says whether another element, of a map another pair, follows; closes the container when none
  * does. */
-zel_Status nextElement(ExprMshReader &reader, CborContainer *container, bool *more);
+inline zel_Status nextElement(ExprMshReader &reader, CborContainer *container, bool *more) {
+  constexpr uint8_t breakByte = 0xff;
+  if (container->indefinite) {
+    if (reader.position >= reader.length) return EXPR_MSH_TRUNCATED;
+    *more = reader.data[reader.position] != breakByte;
+    if (!*more) ++reader.position;
+  } else {
+    *more = container->left != 0;
+    if (*more) --container->left;
+  }
+  if (!*more) --reader.depth;
+  return ZEL_OK;
+}
+
+/* Passes over the name in front of a map's value if it is this one; else the reader stays where it
+ * is, for readName. Compared as it would be written, which costs far less than reading a name; a
+ * long one, or one that is written at greater length than it needs, is left to readName. */
+inline bool skipName(ExprMshReader &reader, std::string_view name) {
+  constexpr uint8_t textHead = 0x60; /* and the length, if that is below 24: RFC 8949, 3.1 */
+  constexpr size_t longest = 23;
+  const uint8_t *at = reader.data + reader.position;
+  if (name.size() > longest || reader.length - reader.position <= name.size()) return false;
+  if (at[0] != textHead + name.size() || std::memcmp(at + 1, name.data(), name.size()) != 0) {
+    return false;
+  }
+  reader.position += 1 + name.size();
+  return true;
+}
 
 /* The name in front of a map's value, where it stands in the data. Only text in one piece is a
  * name: anything else, text in chunks too, is EXPR_MSH_MALFORMED. */

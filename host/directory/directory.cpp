@@ -86,18 +86,18 @@ using SharedEntry =
 using Entries = std::map<Key, SharedEntry>;
 
 /* The first entry that the key asks for, or the end. */
-Entries::const_iterator firstMatch(const Entries &entries, const Key &key) {
+Entries::iterator firstMatch(Entries &entries, const Key &key) {
   if (!isZero(key.uuid)) return entries.find(key);
   const auto first = entries.lower_bound(key);
   return first != entries.end() && first->first.type == key.type ? first : entries.end();
 }
 
-/* The first one behind `after`, or the end. `walked` is a guess where that is, or the end. */
-Entries::const_iterator nextMatch(const Entries &entries, const Key &key, const Key &after,
-                                  Entries::const_iterator walked) {
+/* The first one behind `after`, or the end. `recent` is a guess where that is, or the end. */
+Entries::iterator nextMatch(Entries &entries, const Key &key, const Key &after,
+                            Entries::iterator recent) {
   if (!isZero(key.uuid)) return entries.end();
-  const bool guessed = walked != entries.end() && walked->first == after;
-  const auto next = guessed ? std::next(walked) : entries.upper_bound(after);
+  const bool guessed = recent != entries.end() && recent->first == after;
+  const auto next = guessed ? std::next(recent) : entries.upper_bound(after);
   return next != entries.end() && next->first.type == key.type ? next : entries.end();
 }
 
@@ -128,11 +128,12 @@ struct Directory::Impl {
   SharedEntry exactly(const Key &key);
 
   /* With the lock held. */
-  Entries::const_iterator find(const Key &key) const;
+  bool isRecent(const Key &key) const { return recent != entries.end() && recent->first == key; }
+  Entries::iterator find(const Key &key) { return isRecent(key) ? recent : entries.find(key); }
   void tell(const std::shared_ptr<Subscription> &subscription, const KarstEntryHeader &header,
             zel_Status status);
   void tellMatching(const KeptEntry &entry, zel_Status status);
-  void tellMissed(Subscription &subscription, const Key &key) const;
+  void tellMissed(Subscription &subscription, const Key &key);
   void tellResync();
   void settle();
 
@@ -140,9 +141,9 @@ struct Directory::Impl {
   Mutex mutex;
   /* Guarded by the mutex, to the end. */
   Entries entries;
-  /* Where the last walk stands, or the end: its next step, and reading the entry that it was told of,
-   * need no search. */
-  Entries::const_iterator walked = entries.end();
+  /* What was last put or walked to, or the end: who reads the entry that it was told of, walks a step
+   * on, or changes the same entry again, need not search. */
+  Entries::iterator recent = entries.end();
   zel_UUID self{};
   bool usable = false;
   bool interrupted = false; /* from unusable after usable to the end that settle() finds */
@@ -181,10 +182,6 @@ SharedEntry Directory::Impl::exactly(const Key &key) {
   return found != entries.end() ? found->second : nullptr;
 }
 
-Entries::const_iterator Directory::Impl::find(const Key &key) const {
-  return walked != entries.end() && walked->first == key ? walked : entries.find(key);
-}
-
 void Directory::Impl::tell(const std::shared_ptr<Subscription> &subscription,
                            const KarstEntryHeader &header, zel_Status status) {
   if (subscription->tell(header, status)) ++overflows;
@@ -202,7 +199,7 @@ void Directory::Impl::tellMatching(const KeptEntry &entry, zel_Status status) {
 
 /* A reader that follows a type only while the directory is usable may still go by entries of which
  * it was not told that they have gone. It is told when it starts to follow the type again. */
-void Directory::Impl::tellMissed(Subscription &subscription, const Key &key) const {
+void Directory::Impl::tellMissed(Subscription &subscription, const Key &key) {
   /* Who follows one entry looks it up, and is not to be misled by an owner of the past. */
   if (!interrupted || !isZero(key.uuid)) return;
   for (auto it = firstMatch(missed, key); it != missed.end();
@@ -313,12 +310,14 @@ void Directory::deregisterStatus(KarstStatusFn fn, void *data) {
 
 void Directory::put(Entry entry) {
   const auto present = std::make_shared<const KeptEntry>(std::move(entry));
+  SharedEntry before; /* ends when others have the lock and the news */
   const Announcing announcing(impl_->mutex, impl_->delivery);
   const Key key{present->type, present->uuid};
   impl_->missed.erase(key);
-  SharedEntry &place = impl_->entries[key];
+  if (!impl_->isRecent(key)) impl_->recent = impl_->entries.try_emplace(key).first;
+  SharedEntry &place = impl_->recent->second;
   if (place != nullptr && *place == *present) return;
-  const SharedEntry before = std::exchange(place, present);
+  before = std::exchange(place, present);
   if (before != nullptr && before->owner != present->owner) {
     impl_->tellMatching(*before, ZEL_NOT_FOUND);
   }
@@ -331,7 +330,7 @@ void Directory::remove(uint8_t type, const zel_UUID &uuid) {
   const auto place = impl_->entries.find(key);
   if (place == impl_->entries.end()) return;
   const SharedEntry before = std::move(place->second);
-  if (impl_->walked == place) impl_->walked = impl_->entries.end();
+  if (impl_->recent == place) impl_->recent = impl_->entries.end();
   impl_->entries.erase(place);
   impl_->missed.insert_or_assign(key, before);
   impl_->tellMatching(*before, ZEL_NOT_FOUND);
@@ -391,9 +390,9 @@ zel_Status Directory::findEntry(const KarstQuery &query, uint32_t next,
   const std::optional<Key> after = next == 1 ? keyOf(*header) : key;
   if (!after || after->type != key->type) return ZEL_BAD_PARAM;
   const std::lock_guard<Mutex> lock(impl_->mutex);
-  const auto found = next == 1 ? nextMatch(impl_->entries, *key, *after, impl_->walked)
+  const auto found = next == 1 ? nextMatch(impl_->entries, *key, *after, impl_->recent)
                                : firstMatch(impl_->entries, *key);
-  impl_->walked = found;
+  impl_->recent = found;
   if (found == impl_->entries.end()) return ZEL_NOT_FOUND;
   *header = found->second->header;
   return ZEL_OK;

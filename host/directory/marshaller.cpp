@@ -105,25 +105,27 @@ zel_Status encodeField(ExprMshWriter &writer, const ExprMshField &row, const voi
   }
 }
 
-/* The row of this name, or null. Most writers keep to the order of the table: the search begins at
- * `next`, the row behind the last one found, and goes around. */
-const ExprMshField *findRow(const ExprMshField *table, const ExprMshField *next,
-                            std::string_view name) {
-  for (const ExprMshField *row = next; row->name != nullptr; ++row) {
-    if (name == row->name) return row;
+/* The row of the next pair's name, or null. Most writers keep to the order of the table: `expected`,
+ * the row behind the last one found, is looked at first. */
+zel_Status readRow(ExprMshReader &reader, const ExprMshField *table, const ExprMshField *expected,
+                   const ExprMshField **row) {
+  *row = expected;
+  if (expected->name != nullptr && skipName(reader, expected->name)) return ZEL_OK;
+  std::string_view name;
+  const zel_Status status = readName(reader, &name);
+  if (status != ZEL_OK) return status;
+  for (*row = table; (*row)->name != nullptr; ++*row) {
+    if (name == (*row)->name) return ZEL_OK;
   }
-  for (const ExprMshField *row = table; row != next; ++row) {
-    if (name == row->name) return row;
-  }
-  return nullptr;
+  *row = nullptr;
+  return ZEL_OK;
 }
 
 zel_Status decodePair(ExprMshReader &reader, const ExprMshField *table, void *record,
                       const ExprMshField **next, uint64_t *seen) {
-  std::string_view name;
-  const zel_Status status = readName(reader, &name);
+  const ExprMshField *row;
+  const zel_Status status = readRow(reader, table, *next, &row);
   if (status != ZEL_OK) return status;
-  const ExprMshField *row = findRow(table, *next, name);
   if (row == nullptr) return skipValue(reader);
   *next = row + 1;
   const uint64_t bit = uint64_t{1} << (row - table);

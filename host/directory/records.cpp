@@ -57,8 +57,8 @@ zel_Status decodeAs(const ExprMshField *table, const std::vector<uint8_t> &data,
 /* One pair of the network part's map. */
 zel_Status readNetworkPair(ExprMshReader &reader, NetworkPart *part, bool *typeSeen,
                            bool *ipv4Seen) {
-  std::string_view name;
-  zel_Status status = readName(reader, &name);
+  std::string_view name = *typeSeen ? "ipv4" : "type"; /* what most writers have here */
+  zel_Status status = skipName(reader, name) ? ZEL_OK : readName(reader, &name);
   if (status != ZEL_OK) return status;
   if (name == "type") {
     if (*typeSeen) return EXPR_MSH_MALFORMED;

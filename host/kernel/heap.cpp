@@ -149,8 +149,9 @@ std::map<zel_HeapID, std::unique_ptr<Heap>> &heaps() {
 }
 
 Heap *findHeapLocked(zel_HeapID id) {
-  const auto found = heaps().find(id);
-  return found == heaps().end() ? nullptr : found->second.get();
+  const auto &table = heaps();
+  const auto found = table.find(id);
+  return found == table.end() ? nullptr : found->second.get();
 }
 
 HeapMemory &memoryLocked() {

@@ -30,8 +30,8 @@ static void KARSTResolverTraceSetBits(uint64_t *word, uint64_t *known, uint32_t 
   __atomic_store_n(word, *known, __ATOMIC_RELAXED);
 }
 
-/* A function of its own, as is KARSTResolverTraceEmitThrottled: what they save of their caller's
- * registers, an event that goes no further than Emit is not to pay for. */
+/* A function of its own, as are the two below: what they save of their caller's registers, an event
+ * that goes less far is not to pay for. */
 static __attribute__((noinline)) void KARSTResolverTraceWrite(TraceStream *stream, uint64_t kind,
                                                               const uint64_t payload[6]) {
   uint64_t sequence = __atomic_fetch_add(&stream->sequence, 1, __ATOMIC_RELAXED);
@@ -71,14 +71,13 @@ static uint64_t KARSTResolverTraceNoticeKind(uint32_t id, uint32_t siteNumber) {
   return KARST_RESOLVER_TRACE_KIND(TRACE_RECORD_THROTTLE, id, siteNumber);
 }
 
-/* The two buckets, an event's and the stream's. A bucket's last token is for a notice in the event's
- * place. */
-static __attribute__((noinline)) void KARSTResolverTraceEmitThrottled(TraceStream *stream,
-                                                                      TokenBucketMini *bucket,
-                                                                      uint64_t kind,
-                                                                      const uint64_t payload[6]) {
-  uint64_t left;
-  if (!TokenBucket_UseTokensMini(bucket, perTraceTbConfig, 1, &left)) return;
+/* An event that its own bucket lets through, and `left` more: now the stream's is asked. A bucket's last
+ * token is for a notice in the event's place. */
+static __attribute__((noinline)) void KARSTResolverTraceEmitGranted(TokenBucketMini *bucket,
+                                                                    uint64_t kind,
+                                                                    const uint64_t payload[6],
+                                                                    TraceStream *stream,
+                                                                    uint64_t left) {
   uint64_t notice[6] = {};
   if (left == 0) { /* say that this event is being suppressed */
     notice[0] = TokenBucket_TimeToGetTokens(bucket);
@@ -96,11 +95,22 @@ static __attribute__((noinline)) void KARSTResolverTraceEmitThrottled(TraceStrea
   KARSTResolverTraceWrite(stream, kind, payload);
 }
 
+/* In a flood nearly every event ends here. */
+static __attribute__((noinline)) void KARSTResolverTraceEmitThrottled(TokenBucketMini *bucket,
+                                                                      uint64_t kind,
+                                                                      const uint64_t payload[6],
+                                                                      TraceStream *stream) {
+  uint64_t left;
+  if (TokenBucket_UseTokensMini(bucket, perTraceTbConfig, 1, &left)) {
+    KARSTResolverTraceEmitGranted(bucket, kind, payload, stream, left);
+  }
+}
+
 void KARSTResolverTraceEmit(TokenBucketMini *bucket, uint64_t kind, const uint64_t payload[6]) {
   TraceStream *stream = (TraceStream *)traceStreamTables[1];
   if (!(__atomic_load_n(&stream->flags, __ATOMIC_RELAXED) & TRACE_STREAM_ENABLED)) return;
   if (__atomic_load_n(&stream->throttling, __ATOMIC_RELAXED)) {
-    KARSTResolverTraceEmitThrottled(stream, bucket, kind, payload);
+    KARSTResolverTraceEmitThrottled(bucket, kind, payload, stream);
   } else {
     KARSTResolverTraceWrite(stream, kind, payload);
   }

@@ -1,5 +1,6 @@
 /* What one of many instances of a node costs when the node's locators have changed, and to make and to
  * end; beside one signal with as many slots and a list of functions under a mutex. */
+#include <boost/intrusive/list.hpp>
 #include <boost/signals2.hpp>
 #include <cstring>
 #include <functional>
@@ -126,14 +127,14 @@ class Stores {
 template <typename Lock>
 class LockedStores {
  public:
-  static inline const std::string NAME = limit("stores, six locked exchanges");
+  static inline const std::string NAME = limit("stores, six exchanges");
   explicit LockedStores(size_t observers) : kept_(observers) {}
   void tell(const KARSTResolverNodeLocators &locators) {
     for (Kept &kept : kept_) tell(kept, locators);
   }
 
  protected:
-  struct Kept {
+  struct Kept : boost::intrusive::list_base_hook<> {
     std::atomic<uint64_t> references{1};
     Lock lock;
     KARSTResolverNodeLocators locators;
@@ -154,19 +155,31 @@ class LockedStores {
   std::vector<Kept> kept_;
 };
 
-/* The same with the calls that a module cannot do without: of the locks, of its client, and of the
- * three trace statements that ask whether their class is on. */
+/* The same with the calls that a module cannot do without, of the locks, of its client, and of the three
+ * trace statements that ask whether their class is on; and from list to list, since who leaves while the
+ * cache's lock is given up must not end the walk. */
 class CalledStores : LockedStores<OneExchangeCalled> {
  public:
-  static inline const std::string NAME = limit("stores, six locked exchanges, called");
-  using LockedStores::LockedStores;
+  static inline const std::string NAME = limit("six exchanges, calls, lists");
+  explicit CalledStores(size_t observers) : LockedStores(observers) {
+    for (Kept &kept : kept_) list_.push_front(kept);
+  }
+  ~CalledStores() { list_.clear(); }
+  CalledStores(const CalledStores &) = delete;
+  CalledStores &operator=(const CalledStores &) = delete;
+
   void tell(const KARSTResolverNodeLocators &locators) {
-    for (Kept &kept : kept_) {
+    List pending;
+    pending.swap(list_);
+    while (!pending.empty()) {
+      Kept &kept = pending.front();
       LockedStores::tell(kept, locators);
       client_(&calls_);
       for (int statement = 0; statement < 3; statement++) {
         benchmark::DoNotOptimize(Trace_ClassLevelGet(KARST_RESOLVER_TRACE_CLASS_InvokeCallback));
       }
+      pending.pop_front();
+      list_.push_front(kept);
     }
   }
 
@@ -174,6 +187,8 @@ class CalledStores : LockedStores<OneExchangeCalled> {
   static void count(std::atomic<uint64_t> *calls) {
     calls->store(calls->load(std::memory_order_relaxed) + 1, std::memory_order_relaxed);
   }
+  using List = boost::intrusive::list<Kept, boost::intrusive::constant_time_size<false>>;
+  List list_;
   std::atomic<uint64_t> calls_{0};
   void (*volatile client_)(std::atomic<uint64_t> *calls) = count;
 };

@@ -110,6 +110,15 @@ void ask(const std::string &work, double most, const std::vector<std::string> &p
   ask(bar);
 }
 
+void nameFloor(Bar bar) {
+  bar.most = AT_FLOOR;
+  registry().floors.push_back(std::move(bar));
+}
+
+void nameFloor(const std::string &work, const std::string &limit) {
+  nameFloor({work, {work}, AT_FLOOR, {{work, limit}}});
+}
+
 void askCount(const std::string &text, uint64_t count, uint64_t most) {
   if (Count *said = already(registry().counts, text)) {
     said->count = std::max(said->count, count);

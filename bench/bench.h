@@ -63,11 +63,19 @@ struct Bar {
   double most;
   std::vector<Subject> peers;
   std::vector<Subject> baseline = {}; /* none or one */
+  std::vector<Subject> growth = {};   /* none; or two, and peers count as times the second over the
+                                         first */
 };
 void ask(const Bar &bar);
 
 /* The usual one: our figure of this work against the fastest of these peers. */
 void ask(const std::string &work, double most, const std::vector<std::string> &peers);
+
+/* Where a bar of this text is missed: what the machine, or a rule that ours has to keep, does not go
+ * below, measured in the same run. Ours is at its floor when it takes at most a fifth more. */
+inline constexpr double AT_FLOOR = 1.2;
+void nameFloor(Bar bar); /* whose `most` is AT_FLOOR, whatever it was */
+void nameFloor(const std::string &work, const std::string &limit);
 
 /* Something that is counted, not timed: the count must be at most `most`. Said while or after the
  * benchmarks run; said several times, the largest count stands. */

@@ -72,20 +72,32 @@ Figures::Verdict Figures::judge(const Bar &bar) const {
       verdict.got = NAN;
       return verdict;
     }
-    const double ratio = (ours->nanoseconds - less) / (figure->nanoseconds - less);
+    double ratio = (ours->nanoseconds - less) / (figure->nanoseconds - less);
+    if (!bar.growth.empty()) {
+      const Figure *first = find(bar.growth.front()), *second = find(bar.growth.back());
+      ratio *=
+          first == nullptr || second == nullptr ? NAN : first->nanoseconds / second->nanoseconds;
+    }
     if (verdict.measured() && ratio <= verdict.got) continue;
     verdict.got = ratio;
     verdict.against = peer.work == bar.ours.work ? peer.who : peer.work + ", " + peer.who;
+    if (!bar.growth.empty()) verdict.against = "the growth of " + bar.growth.front().who;
   }
   return verdict;
 }
 
-std::vector<Figures::Verdict> Figures::verdicts() const {
-  std::vector<Verdict> all;
-  for (const Bar &bar : registry().bars) all.push_back(judge(bar));
+std::vector<Figures::Judged> Figures::verdicts() const {
+  std::vector<Judged> all;
+  for (const Bar &bar : registry().bars) {
+    Judged &judged = all.emplace_back(judge(bar));
+    if (!judged.bar.measured() || judged.bar.met()) continue;
+    for (const Bar &floor : registry().floors) {
+      if (floor.text == bar.text) judged.floor = {judge(floor)};
+    }
+  }
   for (const Count &count : registry().counts) {
     all.push_back(
-        {count.text, "", static_cast<double>(count.most), static_cast<double>(count.count)});
+        {{count.text, "", static_cast<double>(count.most), static_cast<double>(count.count)}, {}});
   }
   return all;
 }
@@ -113,18 +125,24 @@ void Figures::print() const {
   }
 
   std::printf("\n%-8s %8s %8s  %s\n", "bar", "at most", "is", "what is asked");
-  size_t met = 0, measured = 0;
-  for (const Verdict &verdict : verdicts()) {
-    met += verdict.met();
-    measured += verdict.measured();
+  size_t met = 0, measured = 0, atFloor = 0;
+  for (const auto &[bar, floor] : verdicts()) {
+    met += bar.met();
+    measured += bar.measured();
     std::printf("%-8s %8.2f %8.2f  %s%s%s\n",
-                !verdict.measured() ? "not run"
-                : verdict.met()     ? "met"
-                                    : "MISSED",
-                verdict.most, verdict.got, verdict.text.c_str(),
-                verdict.against.empty() ? "" : ", against ", verdict.against.c_str());
+                !bar.measured() ? "not run"
+                : bar.met()     ? "met"
+                                : "MISSED",
+                bar.most, bar.got, bar.text.c_str(), bar.against.empty() ? "" : ", against ",
+                bar.against.c_str());
+    for (const Verdict &least : floor) {
+      atFloor += least.met();
+      std::printf("%-8s %8.2f %8.2f    its floor: %s\n", least.met() ? "  kept" : "  MISSED",
+                  least.most, least.got, least.against.c_str());
+    }
   }
-  std::printf("%zu of %zu measured bars are met\n", met, measured);
+  std::printf("%zu of %zu measured bars are met; of the %zu others %zu keep to their floor\n", met,
+              measured, measured - met, atFloor);
 }
 
 nlohmann::ordered_json Figures::json() const {
@@ -138,13 +156,17 @@ nlohmann::ordered_json Figures::json() const {
   for (const auto &[subject, why] : registry().notMeasured) {
     all["not_measured"].push_back({{"work", subject.work}, {"who", subject.who}, {"why", why}});
   }
-  for (const Verdict &verdict : verdicts()) {
-    if (!verdict.measured()) continue;
-    all["bars"].push_back({{"text", verdict.text},
-                           {"against", verdict.against},
-                           {"at_most", verdict.most},
-                           {"is", verdict.got},
-                           {"met", verdict.met()}});
+  const auto jsonOf = [](const Verdict &verdict) {
+    return nlohmann::ordered_json{{"text", verdict.text},
+                                  {"against", verdict.against},
+                                  {"at_most", verdict.most},
+                                  {"is", verdict.got},
+                                  {"met", verdict.met()}};
+  };
+  for (const auto &[bar, floor] : verdicts()) {
+    if (!bar.measured()) continue;
+    auto &said = all["bars"].emplace_back(jsonOf(bar));
+    if (!floor.empty()) said["floor"] = jsonOf(floor.front());
   }
   for (const Statement &said : registry().statements) {
     all["statements"].push_back({{"text", said.text}, {"value", said.value}, {"unit", said.unit}});

@@ -33,11 +33,15 @@ class Figures : public benchmark::BenchmarkReporter {
     bool measured() const { return got == got; }
     bool met() const { return got <= most; }
   };
+  struct Judged {
+    Verdict bar;
+    std::vector<Verdict> floor; /* of one that is missed: none or one */
+  };
 
   const Figure *find(const Subject &subject) const;
   std::vector<std::pair<Subject, Figure>> inOrder() const;
   Verdict judge(const Bar &bar) const;
-  std::vector<Verdict> verdicts() const;
+  std::vector<Judged> verdicts() const;
 
   std::map<Subject, Figure> figures_;
   bool failed_ = false;

@@ -233,8 +233,8 @@ void lookUpName(benchmark::State &state) {
 
 /* ---- The least, and the lock ----------------------------------------------------------------- */
 
-const std::string COPY = limit("copy"), LOCKED_COPY = limit("copy, one exchange, one store"),
-                  CALLED_COPY = limit("copy, one exchange, one store, called");
+const std::string COPY = limit("copy"), LOCKED_COPY = limit("copy, exchange, store"),
+                  CALLED_COPY = limit("copy, exchange, store, called");
 
 void exchange(benchmark::State &state) {
   std::atomic<uint32_t> word{0};
@@ -303,7 +303,7 @@ void measureReadOut(Cluster &cluster) {
   for (const Pace &pace : {ALONE, TEN_KILOHERTZ}) {
     const std::string work = READ + pace.name;
     ask({work, {work}, 1.5, {{READ + ALONE.name, LOCKED_COPY}}});
-    ask({work, {work}, 1.2, {{READ + ALONE.name, CALLED_COPY}}});
+    nameFloor({work, {work}, AT_FLOOR, {{READ + ALONE.name, CALLED_COPY}}});
     ask(work, 0.6, {SHARED_MUTEX});
     ask(work, 1.0, {URCU_MEMB});
   }

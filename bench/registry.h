@@ -24,6 +24,7 @@ struct Registry {
   std::vector<Subject> subjects;              /* in the order in which they were first named */
   std::map<Subject, std::string> notMeasured; /* and why */
   std::vector<Bar> bars;
+  std::vector<Bar> floors;
   std::vector<Count> counts;
   std::vector<Statement> statements;
 };

@@ -29,7 +29,7 @@ const std::string LTTNG_MATCHED = "LTTng-UST, our clock";
 const std::string LTTNG_OFF = "LTTng-UST, tracepoint off";
 const std::string SPDLOG = "spdlog, async, null sink";
 const std::string LEAST = limit("fetch_add, clock, 64-byte store");
-const std::string EMPTY_CALL = "empty call";
+const std::string EMPTY_CALL = limit("empty call");
 const std::string NOTHING = limit("the loop alone");
 
 const std::string OFF = "trace: class off";
@@ -235,10 +235,13 @@ void measureTrace(Cluster &cluster) {
   measureLimits();
   measureSetCallback(cluster);
 
-  ask({OFF + ", over the loop alone", {OFF}, 0.15, {{OFF, EMPTY_CALL}}, {{OFF, NOTHING}}});
+  const Bar off{OFF + ", over the loop alone", {OFF}, 0.15, {{OFF, EMPTY_CALL}}, {{OFF, NOTHING}}};
+  ask(off);
+  nameFloor(off);
   ask(WRITTEN, 0.08, {LTTNG});
   ask(WRITTEN, 0.3, {LTTNG_MATCHED});
   ask(WRITTEN, 1.2, {LEAST});
+  nameFloor(WRITTEN, LEAST);
   ask({THROTTLED, {THROTTLED}, 0.3, {{WRITTEN}}});
 }
 

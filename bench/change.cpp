@@ -308,8 +308,8 @@ void measureLatency(Cluster &cluster, const std::string &where, unsigned process
 
   for (const std::string &work : {idle, streaming}) {
     ask(work + ", p50", 1.2, {peer});
-    nameFloor(work + ", p50", least);
     ask(work + ", p99", 1.5, {peer});
+    for (const char *percentile : {", p50", ", p99"}) nameFloor(work + percentile, least);
   }
 }
 

@@ -14,6 +14,7 @@
 #include "bench/lttng/session.h"
 #include "bench/subjects.h"
 #include "bench/trace_sites.h"
+#include "host/threads/clock.h"
 #include "karst_resolver/trace.h"
 
 namespace bench {
@@ -29,6 +30,7 @@ const std::string LTTNG_MATCHED = "LTTng-UST, our clock";
 const std::string LTTNG_OFF = "LTTng-UST, tracepoint off";
 const std::string SPDLOG = "spdlog, async, null sink";
 const std::string LEAST = limit("fetch_add, clock, 64-byte store");
+const std::string LEAST_REFUSAL = limit("three calls, the tick's clock");
 const std::string EMPTY_CALL = limit("empty call");
 const std::string NOTHING = limit("the loop alone");
 
@@ -90,6 +92,31 @@ class LeastRing {
   };
   std::atomic<uint64_t> sequence_{0};
   std::vector<Record> records_ = std::vector<Record>(host::TraceSettings{}.slots);
+};
+
+/* An event that comes to nothing: its class is on, its payload laid down, its bucket dry by the clock of
+ * the last tick. A platform is asked by calls, and payloads are handed over by one. */
+class LeastRefusal {
+ public:
+  void tenRefused(uint64_t value) {
+    for (int i = 0; i < EVENTS; i++) {
+      if (!isOn()) continue;
+      const uint64_t payload[6] = {value, value, value};
+      emit(payload);
+    }
+  }
+
+ private:
+  __attribute__((noinline)) bool isOn() const { return on_.load(std::memory_order_relaxed); }
+  __attribute__((noinline)) bool take() const {
+    return host::tickNanoseconds() >= due_.load(std::memory_order_relaxed);
+  }
+  __attribute__((noinline)) void emit(const uint64_t payload[6]) {
+    if (on_.load(std::memory_order_relaxed) && take()) written_ += payload[0];
+  }
+  std::atomic<bool> on_{true};
+  std::atomic<uint64_t> due_{UINT64_MAX};
+  uint64_t written_ = 0;
 };
 
 /* The text is made where it is logged; a thread on any processor takes it from a queue, of which the
@@ -178,6 +205,9 @@ void measureLimits() {
     auto *const function = siteFunction<decltype(benchEmptyCalls)>(name);
     measure({OFF, who}, [=](auto &state) { run(state, function); });
   }
+  const auto refusal = std::make_shared<LeastRefusal>();
+  measure({THROTTLED, LEAST_REFUSAL},
+          [=](auto &state) { run(state, [&](uint64_t value) { refusal->tenRefused(value); }); });
   const auto ring = std::make_shared<LeastRing>();
   measureWritten<NoState>(LEAST, [ring](uint64_t value) { ring->tenRecords(value); });
 }
@@ -243,6 +273,7 @@ void measureTrace(Cluster &cluster) {
   ask(WRITTEN, 1.2, {LEAST});
   nameFloor(WRITTEN, LEAST);
   ask({THROTTLED, {THROTTLED}, 0.3, {{WRITTEN}}});
+  nameFloor(THROTTLED, LEAST_REFUSAL);
 }
 
 }  // namespace bench

@@ -92,8 +92,8 @@ TEST(HeapDeathTest, StopsOnBlocksThatAreNotAlive) {
   EXPECT_DEATH((heap.put(block), heap.put(block)), "panic: freeing 0x[0-9a-f]+, which is not");
   EXPECT_DEATH(heap.put(block + 16), "is not alive in heap");
   EXPECT_DEATH(other.put(block), "is not alive in heap");
-  EXPECT_DEATH(zel_HeapAllocWithRA(0x123456, 16, nullptr), "there is no heap 0x123456");
   heap.put(block);
+  EXPECT_DEATH((heap.get(16), zel_HeapDestroy(heap.id), heap.get(16)), "there is no heap 0x");
 }
 
 /* ---- Log ------------------------------------------------------------------------------------- */

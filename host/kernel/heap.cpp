@@ -143,15 +143,23 @@ std::mutex heapsLock;
 HeapMemory *heapMemory = nullptr;    /* of heaps to come; null: malloc */
 zel_HeapID lastHeapID = ZEL_NO_HEAP; /* IDs are never used twice: a stale one is recognised */
 
+/* The heap that was last asked for, or ZEL_NO_HEAP: mostly it is the next one too. */
+zel_HeapID recentHeapID = ZEL_NO_HEAP;
+Heap *recentHeap = nullptr;
+
 std::map<zel_HeapID, std::unique_ptr<Heap>> &heaps() {
   static std::map<zel_HeapID, std::unique_ptr<Heap>> table;
   return table;
 }
 
 Heap *findHeapLocked(zel_HeapID id) {
-  const auto &table = heaps();
-  const auto found = table.find(id);
-  return found == table.end() ? nullptr : found->second.get();
+  if (id != recentHeapID) {
+    const auto found = heaps().find(id);
+    if (found == heaps().end()) return nullptr;
+    recentHeapID = id;
+    recentHeap = found->second.get();
+  }
+  return recentHeap;
 }
 
 HeapMemory &memoryLocked() {
@@ -212,6 +220,8 @@ void heapDestroy(zel_HeapID heap) {
     if (found != heaps().end()) {
       ended = std::move(found->second);
       heaps().erase(found);
+      recentHeapID = ZEL_NO_HEAP;
+      recentHeap = nullptr;
     }
   }
   if (!ended) panicNoHeap("destroying a heap", heap);

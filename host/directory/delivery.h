@@ -80,8 +80,8 @@ class Delivery {
   Condition due_;      /* the ready list has grown, or the end has come */
   Condition returned_; /* a call has returned */
   Condition idle_;     /* the last one has */
-  std::pmr::unsynchronized_pool_resource
-      memory_; /* of the list: filled and emptied by any thread */
+  /* The list is filled on one thread and emptied on another: not with malloc's memory. */
+  std::pmr::unsynchronized_pool_resource memory_;
   std::pmr::deque<std::shared_ptr<Recipient>> ready_{&memory_};
   size_t unannounced_ = 0; /* recipients in the ready list that no thread was woken for */
   uint64_t calls_ = 0;

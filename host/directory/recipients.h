@@ -55,8 +55,8 @@ class Subscription final : public Recipient {
   void *const data_;
   const size_t bound_;
   size_t *const alive_;
-  /* Calls are put by one thread and taken by another: of memory of their own, or each piece of the
-   * queue would go back to malloc on another thread than it came from, which takes a microsecond. */
+  /* Calls are put on one thread and taken on another. A piece of the queue that came from malloc on the
+   * first would go back on the second, and be joined with its neighbours there each time. */
   std::pmr::unsynchronized_pool_resource memory_{{16, sizeof(Call) * 64}};
   std::pmr::deque<Call> calls_{&memory_};
   size_t atStart_ = 0;      /* calls at the front that do not count towards the bound */

@@ -132,11 +132,11 @@ using IntrusiveSet = IntrusiveSetWith<Nothing>;
 using LargerSet = IntrusiveSetWith<std::array<uint64_t, 2>>;
 static_assert(LargerSet::elementSize == OurMap::elementSize);
 
-/* The same with a call for each step, as a map of another module's is used: what a map in a library
+/* That one with a call for each step, as a map of another module's is used: what a map in a library
  * cannot do without. */
-class CalledSet : public IntrusiveSet {
+class CalledSet : public LargerSet {
  public:
-  using IntrusiveSet::IntrusiveSet;
+  using LargerSet::LargerSet;
   uint64_t iterate() const {
     uint64_t sum = 0;
     for (auto at = set_.begin(); at != set_.end(); at = next(at)) sum += at->number;

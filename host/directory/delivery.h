@@ -7,7 +7,6 @@
 #include <deque>
 #include <functional>
 #include <memory>
-#include <memory_resource>
 #include <mutex>
 #include <vector>
 
@@ -80,9 +79,7 @@ class Delivery {
   Condition due_;      /* the ready list has grown, or the end has come */
   Condition returned_; /* a call has returned */
   Condition idle_;     /* the last one has */
-  /* The list is filled on one thread and emptied on another: not with malloc's memory. */
-  std::pmr::unsynchronized_pool_resource memory_;
-  std::pmr::deque<std::shared_ptr<Recipient>> ready_{&memory_};
+  std::deque<std::shared_ptr<Recipient>> ready_;
   size_t unannounced_ = 0; /* recipients in the ready list that no thread was woken for */
   uint64_t calls_ = 0;
   std::vector<uint64_t> running_; /* by thread: number of the call that it makes, or 0 */

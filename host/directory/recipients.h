@@ -6,7 +6,6 @@
 #include <cstddef>
 #include <cstdint>
 #include <deque>
-#include <memory_resource>
 
 #include "host/directory/delivery.h"
 #include "platform/karst_directory.h"
@@ -55,10 +54,7 @@ class Subscription final : public Recipient {
   void *const data_;
   const size_t bound_;
   size_t *const alive_;
-  /* Calls are put on one thread and taken on another. A piece of the queue that came from malloc on the
-   * first would go back on the second, and be joined with its neighbours there each time. */
-  std::pmr::unsynchronized_pool_resource memory_{{16, sizeof(Call) * 64}};
-  std::pmr::deque<Call> calls_{&memory_};
+  std::deque<Call> calls_;
   size_t atStart_ = 0;      /* calls at the front that do not count towards the bound */
   bool overflowed_ = false; /* the last call due is the overflow's */
 };

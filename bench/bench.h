@@ -63,8 +63,8 @@ struct Bar {
   double most;
   std::vector<Subject> peers;
   std::vector<Subject> baseline = {}; /* none or one */
-  std::vector<Subject> growth = {};   /* none; or two, and peers count as times the second over the
-                                         first */
+  std::vector<Subject> growth = {};   /* none; or two: a peer may grow by as much as the first grows
+                                         to the second */
 };
 void ask(const Bar &bar);
 

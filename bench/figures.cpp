@@ -92,7 +92,9 @@ std::vector<Figures::Judged> Figures::verdicts() const {
     Judged &judged = all.emplace_back(judge(bar));
     if (!judged.bar.measured() || judged.bar.met()) continue;
     for (const Bar &floor : registry().floors) {
-      if (floor.text == bar.text) judged.floor = {judge(floor)};
+      if (floor.text != bar.text) continue;
+      const Verdict least = judge(floor);
+      if (least.measured()) judged.floor = {least};
     }
   }
   for (const Count &count : registry().counts) {

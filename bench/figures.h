@@ -35,7 +35,7 @@ class Figures : public benchmark::BenchmarkReporter {
   };
   struct Judged {
     Verdict bar;
-    std::vector<Verdict> floor; /* of one that is missed: none or one */
+    std::vector<Verdict> floor; /* of one that is missed: one, if it was measured */
   };
 
   const Figure *find(const Subject &subject) const;

@@ -172,6 +172,18 @@ TEST_F(DirectoryTest, WholeEntryIsThePresentOneInABlockOfTheCallers) {
   EXPECT_EQ(directory.findFullEntry(header, allocator, &whole), ZEL_NO_MEMORY);
 }
 
+/* As an interface and its health have, one put right after the other. */
+TEST_F(DirectoryTest, KeepsEntriesOfOneUUIDApartAndForgetsWhatIsRemoved) {
+  put(object, {7});
+  put(node, {7});
+  EXPECT_EQ(directory.entry(object, uuid(7)), entry(object, 7));
+  directory.put(entry(node, 7, 2));
+  EXPECT_EQ(directory.entry(node, uuid(7)), entry(node, 7, 2));
+  remove({7});
+  EXPECT_FALSE(directory.entry(node, uuid(7)).has_value());
+  EXPECT_EQ(directory.entry(object, uuid(7)), entry(object, 7));
+}
+
 /* ---- What subscribers are told --------------------------------------------------------------- */
 
 TEST_F(DirectoryTest, TellsWhatIsThereThenEveryChangeInOrder) {

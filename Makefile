@@ -67,9 +67,9 @@ bench: bench-build ## measure the hot paths beside their peers, and plot: build/
 	$(BENCH)/karst-bench --json=build/bench/bench.json
 	tools/plot-bench --into=build/bench/plots --bench=build/bench/bench.json
 
-bench-full: bench-build ## the same with more repetitions, and how cost grows: docs/performance
+bench-full: bench-build ## the same with more rounds, and how cost grows: docs/performance
 	mkdir -p docs/performance
-	$(BENCH)/karst-bench --json=docs/performance/bench.json --benchmark_repetitions=31
+	$(BENCH)/karst-bench --json=docs/performance/bench.json --rounds=31
 	$(BENCH)/karst-growth --json=docs/performance/growth.json
 	tools/plot-bench --into=docs/performance --bench=docs/performance/bench.json \
 	  --growth=docs/performance/growth.json

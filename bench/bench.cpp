@@ -6,7 +6,6 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <cstdio>
 #include <filesystem>
 #include <stdexcept>
 
@@ -67,27 +66,27 @@ Registry &registry() {
 }
 
 std::string nameOf(const Subject &subject) {
-  registry().subjects.push_back(subject);
   return subject.work + SEPARATOR + subject.who;
 }
 
-void showProgress(const benchmark::State &state) {
-  static const bool wanted = isatty(STDERR_FILENO) != 0;
-  static const Clock::time_point start = Clock::now();
-  static Clock::time_point shown = start;
-  static size_t runs = 0;
-  if (!wanted || state.thread_index() != 0) return;
-  runs++;
-  const Clock::time_point now = Clock::now();
-  if (now - shown < std::chrono::seconds(1)) return;
-  shown = now;
-  std::fprintf(stderr, "\r%zu runs of %zu subjects in %.0f s ", runs, registry().subjects.size(),
-               std::chrono::duration<double>(now - start).count());
+benchmark::internal::Benchmark *add(const Subject &subject,
+                                    benchmark::internal::Benchmark *measured) {
+  registry().subjects.push_back(subject);
+  registry().benchmarks[subject] = measured;
+  return measured;
 }
 
 Subject subjectOf(const std::string &name) {
   const size_t end = name.find(SEPARATOR);
   return {name.substr(0, end), name.substr(end + SEPARATOR.size())};
+}
+
+std::string measuredWork(const std::string &work) {
+  for (const char *percentile : {P50, P99}) {
+    const std::string suffix = std::string(", ") + percentile;
+    if (work.ends_with(suffix)) return work.substr(0, work.size() - suffix.size());
+  }
+  return work;
 }
 
 void notMeasured(const Subject &subject, const std::string &why) {

@@ -22,20 +22,17 @@ struct Subject {
   auto operator<=>(const Subject &) const = default;
 };
 
-/* As the benchmark library knows the subject; remembers its place in the order of the table. */
+/* As the benchmark library knows the subject. */
 std::string nameOf(const Subject &subject);
 
-/* On a terminal, once a second: how many runs there have been, and for how long. */
-void showProgress(const benchmark::State &state);
+/* Remembers the subject's place in the order of the table, and what measures it. */
+benchmark::internal::Benchmark *add(const Subject &subject,
+                                    benchmark::internal::Benchmark *measured);
 
-/* Function takes a benchmark::State. All subjects run in one process, their repetitions in random
- * order, so that what disturbs the machine disturbs all of them. */
+/* Function takes a benchmark::State. It is called once a round; rounds.h says in which order. */
 template <typename Function>
 benchmark::internal::Benchmark *measure(const Subject &subject, Function function) {
-  return benchmark::RegisterBenchmark(nameOf(subject).c_str(), [=](benchmark::State &state) {
-    showProgress(state);
-    function(state);
-  });
+  return add(subject, benchmark::RegisterBenchmark(nameOf(subject).c_str(), function));
 }
 
 /* The name of a subject that is no peer but the least that the machine allows. */

@@ -11,8 +11,13 @@
 
 namespace bench {
 
+/* The first round has found out how often a subject is to be repeated; the others save themselves that,
+ * and do as much. */
+void repeatAsOften(const Subject &subject, const benchmark::BenchmarkReporter::Run &run) {
+  registry().benchmarks.at(subject)->Iterations(run.iterations / run.threads);
+}
+
 void Figures::ReportRuns(const std::vector<Run> &runs) {
-  std::map<Subject, std::vector<double>> values;
   for (const Run &run : runs) {
     if (run.error_occurred) {
       std::fprintf(stderr, "%s: %s\n", run.benchmark_name().c_str(), run.error_message.c_str());
@@ -23,37 +28,63 @@ void Figures::ReportRuns(const std::vector<Run> &runs) {
     const Subject subject = subjectOf(run.run_name.function_name);
     const auto items = run.counters.find(ITEMS);
     const double divisor = items == run.counters.end() ? 1 : items->second.value;
-    values[subject].push_back(run.GetAdjustedRealTime() / divisor);
+    nanoseconds_[subject].push_back(run.GetAdjustedRealTime() / divisor);
+    if (nanoseconds_[subject].size() == 1) repeatAsOften(subject, run);
     for (const char *percentile : {P50, P99}) {
       const auto counter = run.counters.find(percentile);
       if (counter == run.counters.end()) continue;
-      values[{subject.work + ", " + percentile, subject.who}].push_back(counter->second.value);
+      nanoseconds_[{subject.work + ", " + percentile, subject.who}].push_back(
+          counter->second.value);
     }
-  }
-  for (auto &[subject, times] : values) {
-    std::sort(times.begin(), times.end());
-    const double median = times[times.size() / 2];
-    const double spread = (times[times.size() * 3 / 4] - times[times.size() / 4]) / 2;
-    figures_[subject] = {median, 100 * spread / median};
   }
 }
 
-const Figures::Figure *Figures::find(const Subject &subject) const {
-  const auto found = figures_.find(subject);
-  return found == figures_.end() ? nullptr : &found->second;
+Figures::Figure Figures::figureOf(Rounds values) {
+  if (values.empty()) return {};
+  std::sort(values.begin(), values.end());
+  const double median = values[values.size() / 2];
+  const double spread = (values[values.size() * 3 / 4] - values[values.size() / 4]) / 2;
+  return {median, median == 0 ? 0 : 100 * spread / median};
+}
+
+const Figures::Rounds *Figures::find(const Subject &subject) const {
+  const auto found = nanoseconds_.find(subject);
+  return found == nanoseconds_.end() ? nullptr : &found->second;
+}
+
+/* Not measured when any of what the bar names was not. */
+Figures::Figure Figures::ratio(const Bar &bar, const Subject &peer) const {
+  Rounds ratios;
+  const Rounds *const ours = find(bar.ours), *const other = find(peer);
+  if (ours == nullptr || other == nullptr) return {};
+  for (const auto &named : {bar.baseline, bar.growth}) {
+    for (const Subject &subject : named) {
+      if (find(subject) == nullptr) return {};
+    }
+  }
+  for (size_t round = 0; round < std::min(ours->size(), other->size()); round++) {
+    const auto at = [&](const Subject &subject) { return find(subject)->at(round); };
+    const double less = bar.baseline.empty() ? 0 : at(bar.baseline.front());
+    const double grown = bar.growth.empty() ? 1 : at(bar.growth.back()) / at(bar.growth.front());
+    ratios.push_back((ours->at(round) - less) / (other->at(round) - less) / grown);
+  }
+  return figureOf(std::move(ratios));
 }
 
 /* Work by work, in the order in which it was first named, each followed by its percentiles. */
-std::vector<std::pair<Subject, Figures::Figure>> Figures::inOrder() const {
-  std::vector<std::pair<Subject, Figure>> ordered;
+std::vector<Figures::Line> Figures::inOrder() const {
+  std::vector<Line> ordered;
   std::set<std::string> done;
   for (const Subject &first : registry().subjects) {
     if (!done.insert(first.work).second) continue;
     for (const std::string suffix : {"", ", p50", ", p99"}) {
       for (const Subject &subject : registry().subjects) {
         if (subject.work != first.work) continue;
-        const Subject named{subject.work + suffix, subject.who};
-        if (const Figure *figure = find(named)) ordered.emplace_back(named, *figure);
+        const Subject named{subject.work + suffix, subject.who}, ours{named.work};
+        const Rounds *const rounds = find(named);
+        if (rounds == nullptr) continue;
+        ordered.push_back({named, figureOf(*rounds), {}});
+        if (named.who != OURS) ordered.back().ratio = ratio({"", ours, 0, {}}, named);
       }
     }
   }
@@ -61,25 +92,15 @@ std::vector<std::pair<Subject, Figures::Figure>> Figures::inOrder() const {
 }
 
 Figures::Verdict Figures::judge(const Bar &bar) const {
-  Verdict verdict{bar.text, "", bar.most, NAN};
-  const Figure *ours = find(bar.ours);
-  const Figure *base = bar.baseline.empty() ? nullptr : find(bar.baseline.front());
-  if (ours == nullptr || (base == nullptr && !bar.baseline.empty())) return verdict;
-  const double less = base == nullptr ? 0 : base->nanoseconds;
+  Verdict verdict{bar.text, "", bar.most, {}};
   for (const Subject &peer : bar.peers) {
-    const Figure *figure = find(peer);
-    if (figure == nullptr) { /* the fastest cannot be named before all are known */
-      verdict.got = NAN;
+    const Figure got = ratio(bar, peer);
+    if (std::isnan(got.median)) { /* the fastest cannot be named before all are known */
+      verdict.got = {};
       return verdict;
     }
-    double ratio = (ours->nanoseconds - less) / (figure->nanoseconds - less);
-    if (!bar.growth.empty()) {
-      const Figure *first = find(bar.growth.front()), *second = find(bar.growth.back());
-      ratio *=
-          first == nullptr || second == nullptr ? NAN : first->nanoseconds / second->nanoseconds;
-    }
-    if (verdict.measured() && ratio <= verdict.got) continue;
-    verdict.got = ratio;
+    if (verdict.measured() && got.median <= verdict.got.median) continue;
+    verdict.got = got;
     verdict.against = peer.work == bar.ours.work ? peer.who : peer.work + ", " + peer.who;
     if (!bar.growth.empty()) verdict.against = "the growth of " + bar.growth.front().who;
   }
@@ -99,23 +120,20 @@ std::vector<Figures::Judged> Figures::verdicts() const {
   }
   for (const Count &count : registry().counts) {
     all.push_back(
-        {{count.text, "", static_cast<double>(count.most), static_cast<double>(count.count)}, {}});
+        {{count.text, "", static_cast<double>(count.most), {static_cast<double>(count.count)}},
+         {}});
   }
   return all;
 }
 
 void Figures::print() const {
-  const auto figures = inOrder();
-  std::printf("\n%-36s %-36s %11s %6s %9s\n", "work", "who", "ns", "+-", "ours/this");
+  std::printf("\n%-36s %-36s %11s %6s %9s %6s\n", "work", "who", "ns", "+-", "ours/this", "+-");
   std::string work;
-  for (const auto &[subject, figure] : figures) {
-    const Figure *ours = find({subject.work});
+  for (const auto &[subject, time, ratio] : inOrder()) {
     std::printf("%-36s %-36s %11.1f %5.1f%%", subject.work == work ? "" : subject.work.c_str(),
-                subject.who.c_str(), figure.nanoseconds, figure.spreadPercent);
+                subject.who.c_str(), time.median, time.spreadPercent);
     work = subject.work;
-    if (ours != nullptr && subject.who != OURS) {
-      std::printf(" %9.2f", ours->nanoseconds / figure.nanoseconds);
-    }
+    if (!std::isnan(ratio.median)) std::printf(" %9.2f %5.1f%%", ratio.median, ratio.spreadPercent);
     std::printf("\n");
   }
   for (const auto &[subject, why] : registry().notMeasured) {
@@ -126,34 +144,37 @@ void Figures::print() const {
     std::printf("%-73s %11.0f %s\n", said.text.c_str(), said.value, said.unit.c_str());
   }
 
-  std::printf("\n%-8s %8s %8s  %s\n", "bar", "at most", "is", "what is asked");
+  std::printf("\n%-8s %8s %8s %6s  %s\n", "bar", "at most", "is", "+-", "what is asked");
   size_t met = 0, measured = 0, atFloor = 0;
-  for (const auto &[bar, floor] : verdicts()) {
+  const std::vector<Judged> all = verdicts();
+  for (const auto &[bar, floor] : all) {
+    if (!bar.measured()) continue;
+    measured++;
     met += bar.met();
-    measured += bar.measured();
-    std::printf("%-8s %8.2f %8.2f  %s%s%s\n",
-                !bar.measured() ? "not run"
-                : bar.met()     ? "met"
-                                : "MISSED",
-                bar.most, bar.got, bar.text.c_str(), bar.against.empty() ? "" : ", against ",
-                bar.against.c_str());
+    std::printf("%-8s %8.2f %8.2f %5.1f%%  %s%s%s\n", bar.met() ? "met" : "MISSED", bar.most,
+                bar.got.median, bar.got.spreadPercent, bar.text.c_str(),
+                bar.against.empty() ? "" : ", against ", bar.against.c_str());
     for (const Verdict &least : floor) {
       atFloor += least.met();
-      std::printf("%-8s %8.2f %8.2f    its floor: %s\n", least.met() ? "  kept" : "  MISSED",
-                  least.most, least.got, least.against.c_str());
+      std::printf("%-8s %8.2f %8.2f %5.1f%%    its floor: %s\n",
+                  least.met() ? "  kept" : "  MISSED", least.most, least.got.median,
+                  least.got.spreadPercent, least.against.c_str());
     }
   }
   std::printf("%zu of %zu measured bars are met; of the %zu others %zu keep to their floor\n", met,
               measured, measured - met, atFloor);
+  if (measured != all.size()) std::printf("%zu bars were not measured\n", all.size() - measured);
 }
 
 nlohmann::ordered_json Figures::json() const {
   nlohmann::ordered_json all;
-  for (const auto &[subject, figure] : inOrder()) {
-    all["figures"].push_back({{"work", subject.work},
-                              {"who", subject.who},
-                              {"nanoseconds", figure.nanoseconds},
-                              {"spread_percent", figure.spreadPercent}});
+  for (const auto &[subject, time, ratio] : inOrder()) {
+    auto &said =
+        all["figures"].emplace_back(nlohmann::ordered_json{{"work", subject.work},
+                                                           {"who", subject.who},
+                                                           {"nanoseconds", time.median},
+                                                           {"spread_percent", time.spreadPercent}});
+    if (!std::isnan(ratio.median)) said["ours_to_this"] = ratio.median;
   }
   for (const auto &[subject, why] : registry().notMeasured) {
     all["not_measured"].push_back({{"work", subject.work}, {"who", subject.who}, {"why", why}});
@@ -162,7 +183,8 @@ nlohmann::ordered_json Figures::json() const {
     return nlohmann::ordered_json{{"text", verdict.text},
                                   {"against", verdict.against},
                                   {"at_most", verdict.most},
-                                  {"is", verdict.got},
+                                  {"is", verdict.got.median},
+                                  {"spread_percent", verdict.got.spreadPercent},
                                   {"met", verdict.met()}};
   };
   for (const auto &[bar, floor] : verdicts()) {

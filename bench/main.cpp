@@ -1,6 +1,7 @@
-/* karst-bench: our hot paths beside their peers, in one process, repetitions interleaved in random
- * order, so that what disturbs the machine disturbs both. Takes Google Benchmark's options, and
- * --json=FILE for the figures and verdicts. */
+/* karst-bench: our hot paths beside their peers, in one process, in rounds, so that what disturbs the
+ * machine disturbs both. Takes --rounds=N (15), --json=FILE for the figures and verdicts, and Google
+ * Benchmark's options, of which --benchmark_filter=REGEX measures some. */
+#include <charconv>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -8,7 +9,7 @@
 #include <fstream>
 #include <nlohmann/json.hpp>
 
-#include "bench/figures.h"
+#include "bench/rounds.h"
 #include "bench/subjects.h"
 #include "host/kernel/log.h"
 
@@ -26,8 +27,17 @@ void write(const std::string &file, const nlohmann::ordered_json &json) {
   if (!out.flush()) throw std::runtime_error(file + " cannot be written");
 }
 
-int run(const std::string &jsonFile) {
+/* The registered benchmarks hold instances, which go before the cluster. */
+struct Registered {
+  Registered() = default;
+  ~Registered() { benchmark::ClearRegisteredBenchmarks(); }
+  Registered(const Registered &) = delete;
+  Registered &operator=(const Registered &) = delete;
+};
+
+int run(size_t rounds, const std::string &filter, const std::string &jsonFile) {
   bench::Cluster cluster; /* its threads run on all processors */
+  const Registered registered;
   bench::pin(0);
   bench::measureMemory(cluster);
   bench::measureMap(cluster);
@@ -39,12 +49,15 @@ int run(const std::string &jsonFile) {
 
   printLoad("before");
   bench::Figures figures;
-  benchmark::RunSpecifiedBenchmarks(&figures);
+  if (!bench::measureInRounds(rounds, filter, figures)) {
+    throw std::runtime_error("nothing that is measured has a name like " + filter);
+  }
   printLoad("after");
-  std::printf("medians of real time; +- is half the distance between the quartiles\n");
+  std::printf(
+      "medians of %zu rounds, times and ratios; +- is half the distance between the quartiles\n",
+      rounds);
   figures.print();
   if (!jsonFile.empty()) write(jsonFile, figures.json());
-  benchmark::ClearRegisteredBenchmarks(); /* they hold instances, which go before the cluster */
   return figures.failed() ? 1 : 0;
 }
 
@@ -59,23 +72,33 @@ std::string takeOption(std::vector<char *> &arguments, const char *prefix) {
   return value;
 }
 
+/* Throws std::runtime_error. */
+size_t numberOf(const std::string &text) {
+  size_t number = 0;
+  const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), number);
+  if (error != std::errc() || *end != '\0' || number == 0) {
+    throw std::runtime_error("--rounds takes a number from 1 up, and not " + text);
+  }
+  return number;
+}
+
 }  // namespace
 
 int main(int argc, char **argv) {
   /* Defaults: an option that is given comes later and wins. */
   char interleaved[] = "--benchmark_enable_random_interleaving=true";
-  char repetitions[] = "--benchmark_repetitions=15";
   char seconds[] = "--benchmark_min_time=0.02";
-  std::vector<char *> arguments{argv[0], interleaved, repetitions, seconds};
+  std::vector<char *> arguments{argv[0], interleaved, seconds};
   arguments.insert(arguments.end(), argv + 1, argv + argc);
   const std::string jsonFile = takeOption(arguments, "--json=");
+  const std::string rounds = takeOption(arguments, "--rounds=");
   int count = static_cast<int>(arguments.size());
   arguments.push_back(nullptr);
   benchmark::Initialize(&count, arguments.data());
   if (benchmark::ReportUnrecognizedArguments(count, arguments.data())) return 2;
   host::setLogThreshold(host::LogThreshold::Warning);
   try {
-    return run(jsonFile);
+    return run(rounds.empty() ? 15 : numberOf(rounds), benchmark::GetBenchmarkFilter(), jsonFile);
   } catch (const std::exception &error) {
     std::fprintf(stderr, "karst-bench: %s\n", error.what());
     return 1;

@@ -21,7 +21,8 @@ struct Statement {
 };
 
 struct Registry {
-  std::vector<Subject> subjects;              /* in the order in which they were first named */
+  std::vector<Subject> subjects; /* in the order in which they were first named */
+  std::map<Subject, benchmark::internal::Benchmark *> benchmarks;
   std::map<Subject, std::string> notMeasured; /* and why */
   std::vector<Bar> bars;
   std::vector<Bar> floors;
@@ -35,5 +36,8 @@ Registry &registry();
 Subject subjectOf(const std::string &name);
 
 inline constexpr const char *P50 = "p50", *P99 = "p99"; /* counters, in nanoseconds */
+
+/* The work that is measured to get the figures of this one, which may be a percentile. */
+std::string measuredWork(const std::string &work);
 
 }  // namespace bench

@@ -50,10 +50,13 @@ struct NoLock {
   void unlock() { asm volatile("" ::: "memory"); }
 };
 
-/* The least that a lock can be, one exchange and one store, and only for one thread. */
+/* The least that a lock can be: one exchange, when nobody has it, and one store. */
 class OneExchange {
  public:
-  void lock() { taken_.exchange(1, std::memory_order_acquire); }
+  void lock() {
+    while (taken_.exchange(1, std::memory_order_acquire) != 0) {
+    }
+  }
   void unlock() { taken_.store(0, std::memory_order_release); }
 
  private:

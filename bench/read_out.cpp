@@ -246,6 +246,7 @@ class BehindCalls {
  public:
   using Visit = NoVisit;
   __attribute__((noinline)) void read(Locators &into) { kept_.read(into); }
+  void write(const Locators &from) { kept_.write(from); }
 
  private:
   Behind<OneExchangeCalled> kept_;
@@ -258,6 +259,15 @@ void measureLimit(const std::string &who) {
   measure({ONE + ALONE.name, who}, [=](auto &state) { readOne(state, *kept); })
       ->UseManualTime()
       ->Iterations(SINGLE_READINGS);
+}
+
+template <typename Kept>
+void measureLimit(const std::string &who, const Pace &pace) {
+  const auto kept = std::make_shared<Kept>();
+  measure({READ + pace.name, who}, [=](auto &state) {
+    const Writer writer(*kept, pace);
+    readMany(state, *kept);
+  });
 }
 
 void measureLock(const std::shared_ptr<Ours> &ours) {
@@ -298,12 +308,13 @@ void measureReadOut(Cluster &cluster) {
   measure({READ + ALONE.name, limit("one exchange")}, exchange);
   measureLimit<Behind<OneExchange>>(LOCKED_COPY);
   measureLimit<BehindCalls>(CALLED_COPY);
+  measureLimit<BehindCalls>(CALLED_COPY, TEN_KILOHERTZ);
   measureLock(make());
 
   for (const Pace &pace : {ALONE, TEN_KILOHERTZ}) {
     const std::string work = READ + pace.name;
     ask({work, {work}, 1.5, {{READ + ALONE.name, LOCKED_COPY}}});
-    nameFloor({work, {work}, AT_FLOOR, {{READ + ALONE.name, CALLED_COPY}}});
+    nameFloor(work, CALLED_COPY);
     ask(work, 0.6, {SHARED_MUTEX});
     ask(work, 1.0, {URCU_MEMB});
   }

@@ -129,9 +129,11 @@ template <typename Lock>
 class LockedStores {
  public:
   static inline const std::string NAME = limit("stores, six exchanges");
-  explicit LockedStores(size_t observers) : kept_(observers) {}
+  explicit LockedStores(size_t observers) {
+    for (size_t i = 0; i < observers; i++) kept_.push_back(std::make_unique<Kept>());
+  }
   void tell(const KARSTResolverNodeLocators &locators) {
-    for (Kept &kept : kept_) tell(kept, locators);
+    for (const auto &kept : kept_) tell(*kept, locators);
   }
 
  protected:
@@ -158,7 +160,7 @@ class LockedStores {
   }
 
   Lock cache_;
-  std::vector<Kept> kept_;
+  std::vector<std::unique_ptr<Kept>> kept_; /* made one by one, as instances are */
 };
 
 /* The same with the calls that a module cannot do without, of the locks, of its client, and of the three
@@ -168,7 +170,7 @@ class CalledStores : LockedStores<OneExchangeCalled> {
  public:
   static inline const std::string NAME = limit("six exchanges, calls, lists");
   explicit CalledStores(size_t observers) : LockedStores(observers) {
-    for (Kept &kept : kept_) list_.push_front(kept);
+    for (const auto &kept : kept_) list_.push_front(*kept);
   }
   ~CalledStores() { list_.clear(); }
   CalledStores(const CalledStores &) = delete;

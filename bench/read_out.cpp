@@ -93,7 +93,7 @@ class Writer {
 template <typename Kept>
 void readMany(benchmark::State &state, Kept &kept) {
   [[maybe_unused]] const typename Kept::Visit visit;
-  Locators read{};
+  alignas(64) Locators read{};
   read.capacity = KARST_RESOLVER_MAX_LOCATORS;
   for (auto _ : state) {
     kept.read(read);
@@ -145,7 +145,7 @@ void readOne(benchmark::State &state, Kept &kept) {
   bench::state("two looks at the timer counter, not counted", static_cast<double>(timer) * scale,
                "ns");
   [[maybe_unused]] const typename Kept::Visit visit;
-  Locators read{};
+  alignas(64) Locators read{};
   read.capacity = KARST_RESOLVER_MAX_LOCATORS;
   std::vector<double> times;
   times.reserve(SINGLE_READINGS);

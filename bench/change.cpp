@@ -79,13 +79,19 @@ class Stage {
   std::thread thread_{[this] { run(); }};
 };
 
-/* As many hand-offs as a change takes, with nothing to do in between but `between`. */
+/* As many hand-offs as a change takes, with nothing to do before the first but `before`, and before the
+ * second but `between`. */
 class HandOffs {
  public:
-  explicit HandOffs(std::function<void()> between = [] {}) : between_(std::move(between)) {
+  explicit HandOffs(
+      std::function<void()> before = [] {}, std::function<void()> between = [] {})
+      : before_(std::move(before)), between_(std::move(between)) {
     settle();
   }
-  void put(bool measured) { first_.put(measured); }
+  void put(bool measured) {
+    before_();
+    first_.put(measured);
+  }
   void settle() {
     first_.settle();
     second_.settle();
@@ -93,7 +99,7 @@ class HandOffs {
   Clock::time_point lastCall() const { return called_; }
 
  private:
-  const std::function<void()> between_;
+  const std::function<void()> before_, between_;
   std::atomic<Clock::time_point> called_{};
   Stage second_{[this](bool measured) {
     if (measured) called_ = Clock::now();
@@ -253,20 +259,42 @@ void burst(benchmark::State &state, Cluster &cluster, WatchedNode &node, Watched
   }
 }
 
-/* What cannot be left out between the hand-offs: the entry is read and decoded. */
-void readEntry(Cluster &cluster) {
-  KarstNetInterfaceEntry record;
-  const auto entry =
-      cluster.kernel.directory().entry(KARST_TYPE_NET_INTERFACE, interfaceUUID(LATENCY_NODE, 0));
-  if (!entry || host::decode(entry->data, &record) != ZEL_OK) std::abort();
-  benchmark::DoNotOptimize(record);
-}
+/* What no change can leave out: the entry is written by who changes it, perhaps on another processor,
+ * and read and decoded by who is told. */
+class WrittenEntry {
+ public:
+  void write() {
+    const std::lock_guard lock(mutex_);
+    written_ = entry_.data;
+  }
+  void read() {
+    std::vector<uint8_t> data;
+    {
+      const std::lock_guard lock(mutex_);
+      data = written_;
+    }
+    KarstNetInterfaceEntry record;
+    if (host::decode(data, &record) != ZEL_OK) std::abort();
+    benchmark::DoNotOptimize(record);
+  }
+
+ private:
+  const host::Entry entry_ = interfaceEntry(LATENCY_NODE, 0, 4);
+  std::mutex mutex_;
+  std::vector<uint8_t> written_;
+};
+
+/* The same hand-offs with that. */
+struct LeastChange {
+  WrittenEntry entry;
+  HandOffs handOffs{[this] { entry.write(); }, [this] { entry.read(); }};
+};
 
 /* The client is on processor 0, what serves it on one or the other, a stream on the client's. */
 void measureLatency(Cluster &cluster, const std::string &where, unsigned processor,
                     const std::shared_ptr<WatchedNode> &node,
                     const std::shared_ptr<WatchedNode> &other) {
-  const std::string peer = "two bare hand-offs", least = limit("two hand-offs, read, decode");
+  const std::string peer = "two bare hand-offs", least = limit("two hand-offs, entry");
 
   const std::string idle = "change to callback, " + where;
   measure({idle}, [=](auto &state) {
@@ -278,10 +306,10 @@ void measureLatency(Cluster &cluster, const std::string &where, unsigned process
     const OthersPinned pinned(processor);
     bareLatency(state, handOffs);
   })->UseManualTime();
-  measure({idle, least}, [=, &cluster](auto &state) {
-    HandOffs handOffs([&] { readEntry(cluster); });
+  measure({idle, least}, [=](auto &state) {
+    LeastChange change;
     const OthersPinned pinned(processor);
-    bareLatency(state, handOffs);
+    bareLatency(state, change.handOffs);
   })->UseManualTime();
   measure({idle, limit("a futex there and back")}, [=](auto &state) {
     futexRoundTrip(state, processor);
@@ -299,11 +327,11 @@ void measureLatency(Cluster &cluster, const std::string &where, unsigned process
     const Stream stream([&] { handOffs.put(false); });
     bareLatency(state, handOffs);
   })->UseManualTime();
-  measure({streaming, least}, [=, &cluster](auto &state) {
-    HandOffs handOffs([&] { readEntry(cluster); });
+  measure({streaming, least}, [=](auto &state) {
+    LeastChange change;
     const OthersPinned pinned(processor);
-    const Stream stream([&] { handOffs.put(false); });
-    bareLatency(state, handOffs);
+    const Stream stream([&] { change.handOffs.put(false); });
+    bareLatency(state, change.handOffs);
   })->UseManualTime();
 
   for (const std::string &work : {idle, streaming}) {

@@ -151,12 +151,17 @@ void Figures::print() const {
     if (!bar.measured()) continue;
     measured++;
     met += bar.met();
-    std::printf("%-8s %8.2f %8.2f %5.1f%%  %s%s%s\n", bar.met() ? "met" : "MISSED", bar.most,
-                bar.got.median, bar.got.spreadPercent, bar.text.c_str(),
-                bar.against.empty() ? "" : ", against ", bar.against.c_str());
+    const char *verdict = bar.met() ? "met" : "MISSED";
+    if (bar.against.empty()) {
+      std::printf("%-8s %8.0f %8.0f %6s  %s\n", verdict, bar.most, bar.got.median, "",
+                  bar.text.c_str());
+      continue;
+    }
+    std::printf("%-8s %8.2f %8.3f %5.1f%%  %s, against %s\n", verdict, bar.most, bar.got.median,
+                bar.got.spreadPercent, bar.text.c_str(), bar.against.c_str());
     for (const Verdict &least : floor) {
       atFloor += least.met();
-      std::printf("%-8s %8.2f %8.2f %5.1f%%    its floor: %s\n",
+      std::printf("%-8s %8.2f %8.3f %5.1f%%    its floor: %s\n",
                   least.met() ? "  kept" : "  MISSED", least.most, least.got.median,
                   least.got.spreadPercent, least.against.c_str());
     }

@@ -11,11 +11,15 @@
 
 namespace bench {
 
+namespace {
+
 /* The first round has found out how often a subject is to be repeated; the others save themselves that,
  * and do as much. */
 void repeatAsOften(const Subject &subject, const benchmark::BenchmarkReporter::Run &run) {
   registry().benchmarks.at(subject)->Iterations(run.iterations / run.threads);
 }
+
+}  // namespace
 
 void Figures::ReportRuns(const std::vector<Run> &runs) {
   for (const Run &run : runs) {
@@ -54,19 +58,19 @@ const Figures::Rounds *Figures::find(const Subject &subject) const {
 
 /* Not measured when any of what the bar names was not. */
 Figures::Figure Figures::ratio(const Bar &bar, const Subject &peer) const {
-  Rounds ratios;
-  const Rounds *const ours = find(bar.ours), *const other = find(peer);
-  if (ours == nullptr || other == nullptr) return {};
-  for (const auto &named : {bar.baseline, bar.growth}) {
+  size_t rounds = SIZE_MAX;
+  for (const auto &named : {std::vector{bar.ours, peer}, bar.baseline, bar.growth}) {
     for (const Subject &subject : named) {
-      if (find(subject) == nullptr) return {};
+      const Rounds *const measured = find(subject);
+      rounds = std::min(rounds, measured == nullptr ? 0 : measured->size());
     }
   }
-  for (size_t round = 0; round < std::min(ours->size(), other->size()); round++) {
-    const auto at = [&](const Subject &subject) { return find(subject)->at(round); };
+  Rounds ratios;
+  for (size_t round = 0; round < rounds; round++) {
+    const auto at = [&](const Subject &subject) { return (*find(subject))[round]; };
     const double less = bar.baseline.empty() ? 0 : at(bar.baseline.front());
     const double grown = bar.growth.empty() ? 1 : at(bar.growth.back()) / at(bar.growth.front());
-    ratios.push_back((ours->at(round) - less) / (other->at(round) - less) / grown);
+    ratios.push_back((at(bar.ours) - less) / (at(peer) - less) / grown);
   }
   return figureOf(std::move(ratios));
 }

@@ -67,26 +67,41 @@ std::vector<std::string> groups(const std::string &filter) {
   return expressions;
 }
 
-void showProgress(size_t round, size_t rounds, Clock::time_point start) {
-  static Clock::time_point shown = start;
-  const Clock::time_point now = Clock::now();
-  if (isatty(STDERR_FILENO) == 0 || now - shown < std::chrono::seconds(1)) return;
-  shown = now;
-  std::fprintf(stderr, "\rround %zu of %zu, %.0f s ", round, rounds,
-               std::chrono::duration<double>(now - start).count());
-}
+/* A line on a terminal, once a second; gone at the end. */
+class Progress {
+ public:
+  explicit Progress(size_t rounds) : rounds_(rounds) {}
+  ~Progress() {
+    if (shown_ != start_) std::fprintf(stderr, "\r\033[K");
+  }
+  Progress(const Progress &) = delete;
+  Progress &operator=(const Progress &) = delete;
+
+  void show(size_t round) {
+    const Clock::time_point now = Clock::now();
+    if (isatty(STDERR_FILENO) == 0 || now - shown_ < std::chrono::seconds(1)) return;
+    shown_ = now;
+    std::fprintf(stderr, "\rround %zu of %zu, %.0f s ", round, rounds_,
+                 std::chrono::duration<double>(now - start_).count());
+  }
+
+ private:
+  const size_t rounds_;
+  const Clock::time_point start_ = Clock::now();
+  Clock::time_point shown_ = start_;
+};
 
 }  // namespace
 
 bool measureInRounds(size_t rounds, const std::string &filter, Figures &figures) {
   std::mt19937 random(std::random_device{}());
   std::vector<std::string> due = groups(filter);
-  const Clock::time_point start = Clock::now();
+  Progress progress(rounds);
   for (size_t round = 1; round <= rounds; round++) {
     std::shuffle(due.begin(), due.end(), random);
     for (const std::string &group : due) {
       benchmark::RunSpecifiedBenchmarks(&figures, group); /* in random order, says main */
-      showProgress(round, rounds, start);
+      progress.show(round);
     }
   }
   return !due.empty();

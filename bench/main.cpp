@@ -1,6 +1,6 @@
 /* karst-bench: our hot paths beside their peers, in one process, in rounds, so that what disturbs the
- * machine disturbs both. Takes --rounds=N (15), --json=FILE for the figures and verdicts, and Google
- * Benchmark's options, of which --benchmark_filter=REGEX measures some. */
+ * machine disturbs both. --help says which options there are.
+ * Exit status: 0 measured, whatever the verdicts; 1 something could not be; 2 an option is wrong. */
 #include <charconv>
 #include <cstdio>
 #include <cstdlib>
@@ -8,6 +8,8 @@
 #include <exception>
 #include <fstream>
 #include <nlohmann/json.hpp>
+#include <regex>
+#include <stdexcept>
 
 #include "bench/rounds.h"
 #include "bench/subjects.h"
@@ -50,7 +52,7 @@ int run(size_t rounds, const std::string &filter, const std::string &jsonFile) {
   printLoad("before");
   bench::Figures figures;
   if (!bench::measureInRounds(rounds, filter, figures)) {
-    throw std::runtime_error("nothing that is measured has a name like " + filter);
+    throw std::invalid_argument("nothing that is measured has a name like " + filter);
   }
   printLoad("after");
   std::printf(
@@ -72,12 +74,24 @@ std::string takeOption(std::vector<char *> &arguments, const char *prefix) {
   return value;
 }
 
-/* Throws std::runtime_error. */
+void printHelp() {
+  std::printf(
+      "karst-bench measures the resolver's hot paths beside their peers, and says which bars are "
+      "met.\n"
+      "\n"
+      "  --rounds=N                  how often each subject is measured; 15 if not said\n"
+      "  --json=FILE                 write figures and verdicts, for tools/plot-bench\n"
+      "  --benchmark_filter=REGEX    only subjects with such a name, \"map: churn, n = 128 | "
+      "ours\"\n"
+      "  --benchmark_min_time=S      seconds of each measurement, at least; 0.02 if not said\n");
+}
+
+/* Throws std::invalid_argument. */
 size_t numberOf(const std::string &text) {
   size_t number = 0;
   const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), number);
   if (error != std::errc() || *end != '\0' || number == 0) {
-    throw std::runtime_error("--rounds takes a number from 1 up, and not " + text);
+    throw std::invalid_argument("--rounds takes a number from 1 up, and not " + text);
   }
   return number;
 }
@@ -94,13 +108,15 @@ int main(int argc, char **argv) {
   const std::string rounds = takeOption(arguments, "--rounds=");
   int count = static_cast<int>(arguments.size());
   arguments.push_back(nullptr);
-  benchmark::Initialize(&count, arguments.data());
+  benchmark::Initialize(&count, arguments.data(), printHelp);
   if (benchmark::ReportUnrecognizedArguments(count, arguments.data())) return 2;
   host::setLogThreshold(host::LogThreshold::Warning);
   try {
     return run(rounds.empty() ? 15 : numberOf(rounds), benchmark::GetBenchmarkFilter(), jsonFile);
   } catch (const std::exception &error) {
     std::fprintf(stderr, "karst-bench: %s\n", error.what());
-    return 1;
+    const bool asked = dynamic_cast<const std::invalid_argument *>(&error) != nullptr ||
+                       dynamic_cast<const std::regex_error *>(&error) != nullptr;
+    return asked ? 2 : 1;
   }
 }

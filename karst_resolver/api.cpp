@@ -152,7 +152,7 @@ EXPORTED zel_Status KARSTResolver_GetNodeLocators(KARSTResolverInstance *instanc
   const KARSTResolverNodeLocators *own = &instance->locators;
   /* Copied in line and in large pieces, for clients do this most of all: first what lies together at
    * the start, the UUID and both versions; at last, as most nodes have them, all slots at once, up to
-   * the next 16 bytes and then by 16 each, so that no piece lies in two cache lines. */
+   * the next 16 bytes and then by 16 each: no piece lies in two cache lines if the whole begins so. */
   __builtin_memcpy(nodeLocators, own, offsetof(KARSTResolverNodeLocators, reserved));
   nodeLocators->trafficType = own->trafficType;
   uint16_t count = nodeLocators->capacity < own->count ? nodeLocators->capacity : own->count;
